@@ -23,7 +23,6 @@ constexpr DWORD WAIT_OBJECT_0 = 0;
 constexpr DWORD WAIT_ABANDONED = 0x80;
 constexpr DWORD WAIT_TIMEOUT = 258;
 constexpr DWORD WAIT_FAILED = 0xFFFFFFFFu;
-constexpr int RAND_MAX = 0x7FFF;
 
 struct SECURITY_ATTRIBUTES;
 

@@ -1,0 +1,276 @@
+// Internals of the platform layer, shared by its .cpp files only. Nothing
+// outside src/platform includes this header.
+//
+// Include it before any Linux header: Linux defines macros named like several
+// Winsock constants (SOL_SOCKET, SO_SNDBUF, AF_INET6, SOMAXCONN ...) with other
+// values. The aliases in platform::wsa are fixed here, before those macros
+// exist, and are what the layer's .cpp files use for Winsock values.
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <deque>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "fault.h"
+#include "win32.h"
+#include "winsock.h"
+
+namespace platform::wsa {
+constexpr int afInet = AF_INET;
+constexpr int afInet6 = AF_INET6;
+constexpr int solSocket = SOL_SOCKET;
+constexpr int soReuseAddr = SO_REUSEADDR;
+constexpr int soKeepAlive = SO_KEEPALIVE;
+constexpr int soSndBuf = SO_SNDBUF;
+constexpr int soRcvBuf = SO_RCVBUF;
+constexpr int soError = SO_ERROR;
+constexpr int soType = SO_TYPE;
+constexpr int soMaxMsgSize = SO_MAX_MSG_SIZE;
+constexpr int sockStream = SOCK_STREAM;
+constexpr int sockDgram = SOCK_DGRAM;
+constexpr int ipprotoTcp = IPPROTO_TCP;
+constexpr int tcpNoDelay = 0x0001;
+}  // namespace platform::wsa
+
+namespace platform::detail {
+
+// ---- Errors ---------------------------------------------------------------
+
+// Maps a Linux errno value to the Winsock code with the same meaning.
+int wsaErrorFromErrno(int err);
+// Sets this thread's Winsock error and returns SOCKET_ERROR, so call sites end
+// with `return fail(WSAEINVAL);`.
+int fail(int wsaError);
+int failFromErrno(int err);
+
+// ---- Handle tables --------------------------------------------------------
+
+// Handles name slots of a table, with a generation so that a stale handle is
+// recognised instead of naming whatever took its slot later. The top byte
+// tags the kind of object, so CloseHandle can tell a mutex from an event.
+enum class HandleKind : std::uint64_t { Socket = 1, Event = 2, Mutex = 3 };
+
+template <class T>
+class HandleTable {
+ public:
+  explicit HandleTable(HandleKind kind) : kind_(static_cast<std::uint64_t>(kind)) {}
+
+  std::uint64_t insert(std::shared_ptr<T> object) {
+    std::lock_guard<std::mutex> hold(lock_);
+    std::uint32_t index;
+    if (!free_.empty()) {
+      index = free_.back();
+      free_.pop_back();
+    } else {
+      index = static_cast<std::uint32_t>(slots_.size());
+      slots_.push_back({});
+    }
+    Slot& slot = slots_[index];
+    slot.object = std::move(object);
+    return encode(index, slot.generation);
+  }
+
+  std::shared_ptr<T> find(std::uint64_t handle) const {
+    std::uint32_t index;
+    std::uint32_t generation;
+    if (!decode(handle, index, generation)) return nullptr;
+    std::lock_guard<std::mutex> hold(lock_);
+    if (index >= slots_.size() || slots_[index].generation != generation) return nullptr;
+    return slots_[index].object;
+  }
+
+  std::shared_ptr<T> remove(std::uint64_t handle) {
+    std::uint32_t index;
+    std::uint32_t generation;
+    if (!decode(handle, index, generation)) return nullptr;
+    std::lock_guard<std::mutex> hold(lock_);
+    if (index >= slots_.size() || slots_[index].generation != generation) return nullptr;
+    std::shared_ptr<T> object = std::move(slots_[index].object);
+    if (!object) return nullptr;
+    slots_[index].generation = (slots_[index].generation + 1) & kGenerationMask;
+    free_.push_back(index);
+    return object;
+  }
+
+  // Every live object with its handle, taken out of the table.
+  std::vector<std::pair<std::uint64_t, std::shared_ptr<T>>> removeAll() {
+    std::vector<std::pair<std::uint64_t, std::shared_ptr<T>>> all;
+    std::lock_guard<std::mutex> hold(lock_);
+    for (std::uint32_t i = 0; i < slots_.size(); ++i) {
+      if (!slots_[i].object) continue;
+      all.emplace_back(encode(i, slots_[i].generation), std::move(slots_[i].object));
+      slots_[i].generation = (slots_[i].generation + 1) & kGenerationMask;
+      free_.push_back(i);
+    }
+    return all;
+  }
+
+ private:
+  static constexpr std::uint32_t kGenerationMask = 0xFFFFFFu;
+  struct Slot {
+    std::shared_ptr<T> object;
+    std::uint32_t generation = 0;
+  };
+
+  std::uint64_t encode(std::uint32_t index, std::uint32_t generation) const {
+    return (kind_ << 56) | (std::uint64_t(generation) << 32) | (std::uint64_t(index) + 1);
+  }
+  bool decode(std::uint64_t handle, std::uint32_t& index, std::uint32_t& generation) const {
+    if ((handle >> 56) != kind_) return false;
+    std::uint64_t low = handle & 0xFFFFFFFFu;
+    if (low == 0) return false;
+    index = static_cast<std::uint32_t>(low - 1);
+    generation = static_cast<std::uint32_t>((handle >> 32) & kGenerationMask);
+    return true;
+  }
+
+  const std::uint64_t kind_;
+  mutable std::mutex lock_;
+  std::vector<Slot> slots_;
+  std::vector<std::uint32_t> free_;
+};
+
+inline std::uint64_t handleValue(const void* h) { return reinterpret_cast<std::uintptr_t>(h); }
+inline HANDLE toHandle(std::uint64_t v) { return reinterpret_cast<HANDLE>(static_cast<std::uintptr_t>(v)); }
+
+// ---- Completions and the per-thread reactor -------------------------------
+
+struct Completion {
+  LPWSAOVERLAPPED_COMPLETION_ROUTINE routine;
+  DWORD error;
+  DWORD bytes;
+  WSAOVERLAPPED* overlapped;
+  DWORD flags;
+};
+
+// Every thread that issues overlapped I/O or waits owns one reactor: its queue
+// of finished operations, and an eventfd that other threads write to wake its
+// wait. Completion routines run only from the owner's alertable waits.
+class Reactor {
+ public:
+  Reactor();
+  ~Reactor();
+  Reactor(const Reactor&) = delete;
+  Reactor& operator=(const Reactor&) = delete;
+
+  static const std::shared_ptr<Reactor>& current();
+
+  // Any thread. Queues a finished operation for the owner and wakes it.
+  void post(const Completion& completion);
+  // Owner only. Runs every queued completion in order; true if any ran.
+  bool runCompletions();
+  bool hasCompletions();
+  // Any thread: make the owner's current or next poll return.
+  void wake();
+  // Owner only: clears pending wake-ups after a poll.
+  void drainWake();
+  int wakeFd() const { return wakeFd_; }
+
+  // Sockets on which this thread has operations under way (owner only).
+  std::vector<std::shared_ptr<struct SocketState>> ioSockets;
+  void watch(const std::shared_ptr<struct SocketState>& socket);
+
+ private:
+  int wakeFd_ = -1;
+  std::mutex lock_;
+  std::vector<Completion> queue_;
+  std::atomic<bool> pending_{false};
+};
+
+// ---- Events ---------------------------------------------------------------
+
+// A manual-reset event. Its state and its waiters are guarded by the one
+// global event lock; lock order is socket lock, then event lock.
+struct EventObject {
+  bool signalled = false;
+  std::vector<Reactor*> waiters;
+  std::weak_ptr<struct SocketState> socket;  // set by WSAEventSelect
+};
+
+std::mutex& eventLock();
+std::shared_ptr<EventObject> findEvent(WSAEVENT handle);
+// Signals with the event lock held by the caller.
+void signalLocked(EventObject& event);
+
+// ---- Sockets ----------------------------------------------------------------
+
+struct Operation {
+  bool isSend;
+  WSABUF buffers[8];
+  DWORD count;
+  std::size_t total;
+  std::size_t done;
+  WSAOVERLAPPED* overlapped;
+  LPWSAOVERLAPPED_COMPLETION_ROUTINE routine;
+  std::shared_ptr<Reactor> owner;
+};
+
+enum class Phase { Fresh, Connecting, Connected, Listening, Failed };
+
+struct SocketState {
+  std::mutex lock;
+  int fd = -1;
+  int type = 0;  // SOCK_STREAM or SOCK_DGRAM (Winsock values)
+  Phase phase = Phase::Fresh;
+  bool closed = false;
+  bool shutWrite = false;        // no new sends are taken
+  bool shutdownPending = false;  // shut the write side once `sends` drains
+  int streamError = 0;  // a reset or broken pipe seen by a send
+
+  // Event selection and the record of network events.
+  std::shared_ptr<EventObject> event;
+  long selected = 0;
+  long recorded = 0;
+  int errors[FD_MAX_EVENTS] = {};
+  bool readEnabled = true;
+  bool writeEnabled = false;
+  bool acceptEnabled = true;
+  bool closeReported = false;
+
+  // Values set through setsockopt, read back as set.
+  int sendBuffer = -1;
+  int receiveBuffer = -1;
+
+  std::deque<Operation*> sends;
+  std::deque<Operation*> receives;
+  std::size_t unflushed = 0;  // bytes of `sends` not yet taken by the kernel
+  bool sendBlocked = false;   // the kernel refused; wait for POLLOUT
+};
+
+std::shared_ptr<SocketState> findSocket(SOCKET s);
+HandleTable<SocketState>& socketTable();
+bool winsockStarted();
+
+// Records network events from poll's revents (socket lock held) and signals
+// the linked event when a selected one is recorded.
+void recordReadiness(SocketState& socket, short revents);
+// What poll should watch on this socket for its event selection and its
+// operations; 0 means leave it out of the poll set.
+short pollInterest(const SocketState& socket);
+// Moves data for queued operations (socket lock held). Finished operations are
+// posted to their owners' reactors.
+void progressSends(SocketState& socket);
+void progressReceives(SocketState& socket);
+// Ends every queued operation with `error` (socket lock held).
+void abortOperations(SocketState& socket, DWORD error);
+// Flushes what the kernel takes without blocking, aborts the rest and closes
+// the descriptor (socket lock held).
+void closeLocked(SocketState& socket);
+// A zero-timeout poll of one socket, then recordReadiness (socket lock held).
+void refresh(SocketState& socket);
+
+// ---- Waiting ----------------------------------------------------------------
+
+// The wait behind WSAWaitForMultipleEvents and SleepEx.
+DWORD waitForEvents(DWORD count, const WSAEVENT* events, DWORD milliseconds, bool alertable);
+
+}  // namespace platform::detail
+
+namespace platform::fault {
+bool catalogueOverride(std::vector<WSAPROTOCOL_INFOA>& out);
+WORD agreedVersion();
+}  // namespace platform::fault

@@ -1,0 +1,284 @@
+// Overlapped WSASend and WSARecv with completion routines.
+#include "internal.h"  // first: see the note there
+
+#include <sys/socket.h>
+#include <sys/uio.h>
+
+#include <cerrno>
+#include <algorithm>
+
+namespace platform {
+namespace detail {
+namespace {
+
+// Sends taken but not yet handed to the kernel, per socket, before WSASend
+// answers WSA_IO_PENDING instead of success.
+constexpr std::size_t kDeferLimit = 1u << 20;
+constexpr int kMaxGather = 1024;  // IOV_MAX on Linux
+
+void finish(Operation* op, DWORD error, DWORD bytes) {
+  op->owner->post(Completion{op->routine, error, bytes, op->overlapped, 0});
+  delete op;
+}
+
+// Fills `iov` with what is left of `op`, from byte `op->done` on.
+int gather(const Operation& op, iovec* iov, int room) {
+  int n = 0;
+  std::size_t skip = op.done;
+  for (DWORD i = 0; i < op.count && n < room; ++i) {
+    std::size_t len = op.buffers[i].len;
+    if (skip >= len) {
+      skip -= len;
+      continue;
+    }
+    iov[n].iov_base = op.buffers[i].buf + skip;
+    iov[n].iov_len = len - skip;
+    skip = 0;
+    ++n;
+  }
+  return n;
+}
+
+void failSends(SocketState& socket, int err) {
+  DWORD code = static_cast<DWORD>(wsaErrorFromErrno(err));
+  while (!socket.sends.empty()) {
+    Operation* op = socket.sends.front();
+    socket.sends.pop_front();
+    finish(op, code, static_cast<DWORD>(op->done));
+  }
+  socket.unflushed = 0;
+}
+
+void progressStreamSends(SocketState& socket) {
+  iovec iov[kMaxGather];
+  while (!socket.sends.empty()) {
+    int n = 0;
+    std::size_t offered = 0;
+    for (Operation* op : socket.sends) {
+      if (n == kMaxGather) break;
+      int added = gather(*op, iov + n, kMaxGather - n);
+      for (int i = n; i < n + added; ++i) offered += iov[i].iov_len;
+      n += added;
+    }
+    msghdr message{};
+    message.msg_iov = iov;
+    message.msg_iovlen = static_cast<std::size_t>(n);
+    ssize_t written = ::sendmsg(socket.fd, &message, MSG_NOSIGNAL | MSG_DONTWAIT);
+    if (written < 0) {
+      if (errno == EINTR) continue;
+      if (errno == EAGAIN || errno == EWOULDBLOCK) {
+        socket.sendBlocked = true;
+        return;
+      }
+      socket.streamError = errno;
+      failSends(socket, errno);
+      return;
+    }
+    socket.sendBlocked = false;
+    std::size_t left = static_cast<std::size_t>(written);
+    socket.unflushed -= left;
+    while (left > 0) {
+      Operation* op = socket.sends.front();
+      std::size_t take = std::min(left, op->total - op->done);
+      op->done += take;
+      left -= take;
+      if (op->done < op->total) break;
+      socket.sends.pop_front();
+      finish(op, 0, static_cast<DWORD>(op->total));
+    }
+    // Empty sends complete as soon as everything before them has gone.
+    while (!socket.sends.empty() && socket.sends.front()->done == socket.sends.front()->total) {
+      Operation* op = socket.sends.front();
+      socket.sends.pop_front();
+      finish(op, 0, static_cast<DWORD>(op->total));
+    }
+    if (static_cast<std::size_t>(written) < offered) {
+      socket.sendBlocked = true;
+      return;
+    }
+  }
+}
+
+void progressDatagramSends(SocketState& socket) {
+  iovec iov[8];
+  while (!socket.sends.empty()) {
+    Operation* op = socket.sends.front();
+    int n = gather(*op, iov, 8);
+    msghdr message{};
+    message.msg_iov = iov;
+    message.msg_iovlen = static_cast<std::size_t>(n);
+    ssize_t written = ::sendmsg(socket.fd, &message, MSG_NOSIGNAL | MSG_DONTWAIT);
+    if (written < 0) {
+      if (errno == EINTR) continue;
+      if (errno == EAGAIN || errno == EWOULDBLOCK) {
+        socket.sendBlocked = true;
+        return;
+      }
+      // A port-unreachable report from an earlier datagram surfaces here;
+      // it says nothing about this one, so send it again.
+      if (errno == ECONNREFUSED) continue;
+      int err = errno;
+      socket.sends.pop_front();
+      socket.unflushed -= op->total;
+      finish(op, static_cast<DWORD>(wsaErrorFromErrno(err)), 0);
+      continue;
+    }
+    socket.sendBlocked = false;
+    socket.sends.pop_front();
+    socket.unflushed -= op->total;
+    finish(op, 0, static_cast<DWORD>(written));
+  }
+}
+
+// One read into the operation's buffers. Returns bytes, or -1 with errno.
+ssize_t readInto(SocketState& socket, Operation& op) {
+  iovec iov[8];
+  int n = gather(op, iov, 8);
+  msghdr message{};
+  message.msg_iov = iov;
+  message.msg_iovlen = static_cast<std::size_t>(n);
+  for (;;) {
+    ssize_t got = ::recvmsg(socket.fd, &message, MSG_DONTWAIT);
+    if (got >= 0) return got;
+    if (errno == EINTR) continue;
+    // ICMP noise on datagram sockets: drop it and look again.
+    if (errno == ECONNREFUSED && socket.type == wsa::sockDgram) continue;
+    return -1;
+  }
+}
+
+Operation* makeOperation(bool isSend, WSABUF* buffers, DWORD count, WSAOVERLAPPED* overlapped,
+                         LPWSAOVERLAPPED_COMPLETION_ROUTINE routine) {
+  auto* op = new Operation{};
+  op->isSend = isSend;
+  op->count = count;
+  op->total = 0;
+  for (DWORD i = 0; i < count; ++i) {
+    op->buffers[i] = buffers[i];
+    op->total += buffers[i].len;
+  }
+  op->overlapped = overlapped;
+  op->routine = routine;
+  op->owner = Reactor::current();
+  return op;
+}
+
+}  // namespace
+
+void progressSends(SocketState& socket) {
+  if (socket.fd < 0) return;
+  if (socket.type == wsa::sockDgram) {
+    progressDatagramSends(socket);
+  } else {
+    progressStreamSends(socket);
+  }
+  if (socket.sends.empty() && socket.shutdownPending) {
+    socket.shutdownPending = false;
+    ::shutdown(socket.fd, SHUT_WR);
+  }
+}
+
+void progressReceives(SocketState& socket) {
+  if (socket.fd < 0) return;
+  while (!socket.receives.empty()) {
+    Operation* op = socket.receives.front();
+    ssize_t got = readInto(socket, *op);
+    if (got < 0) {
+      if (errno == EAGAIN || errno == EWOULDBLOCK) return;
+      int err = errno;
+      socket.receives.pop_front();
+      finish(op, static_cast<DWORD>(wsaErrorFromErrno(err)), 0);
+      continue;
+    }
+    socket.receives.pop_front();
+    finish(op, 0, static_cast<DWORD>(got));
+  }
+}
+
+void abortOperations(SocketState& socket, DWORD error) {
+  while (!socket.sends.empty()) {
+    Operation* op = socket.sends.front();
+    socket.sends.pop_front();
+    finish(op, error, 0);
+  }
+  while (!socket.receives.empty()) {
+    Operation* op = socket.receives.front();
+    socket.receives.pop_front();
+    finish(op, error, 0);
+  }
+  socket.unflushed = 0;
+}
+
+}  // namespace detail
+
+int WSASend(SOCKET s, WSABUF* lpBuffers, DWORD dwBufferCount, DWORD* lpNumberOfBytesSent, DWORD,
+            WSAOVERLAPPED* lpOverlapped, LPWSAOVERLAPPED_COMPLETION_ROUTINE lpCompletionRoutine) {
+  int result = 0;
+  bool forcePending = false;
+  bool faulted = fault::check(fault::Call::WSASend, result);
+  std::shared_ptr<detail::SocketState> socket = detail::findSocket(s);
+  if (!socket) return detail::fail(WSAENOTSOCK);
+  if (faulted) {
+    if (result == WSAEWOULDBLOCK) {
+      // A refused send arms FD_WRITE, as a full send buffer would.
+      std::lock_guard<std::mutex> hold(socket->lock);
+      socket->writeEnabled = true;
+      detail::refresh(*socket);
+      return detail::fail(WSAEWOULDBLOCK);
+    }
+    if (result != WSA_IO_PENDING) return detail::fail(result);
+    forcePending = true;
+  }
+  if (lpBuffers == nullptr || dwBufferCount == 0 || dwBufferCount > 8) return detail::fail(WSAEINVAL);
+  if (lpOverlapped == nullptr || lpCompletionRoutine == nullptr) return detail::fail(WSAEINVAL);
+  std::lock_guard<std::mutex> hold(socket->lock);
+  if (socket->closed) return detail::fail(WSAENOTSOCK);
+  if (socket->type == wsa::sockStream) {
+    if (socket->phase == detail::Phase::Connecting) detail::refresh(*socket);
+    if (socket->phase != detail::Phase::Connected) return detail::fail(WSAENOTCONN);
+    if (socket->shutWrite) return detail::fail(WSAESHUTDOWN);
+    if (socket->streamError != 0) return detail::failFromErrno(socket->streamError);
+  }
+  detail::Operation* op = detail::makeOperation(true, lpBuffers, dwBufferCount, lpOverlapped, lpCompletionRoutine);
+  socket->sends.push_back(op);
+  socket->unflushed += op->total;
+  detail::Reactor::current()->watch(socket);
+  if (forcePending || socket->unflushed > detail::kDeferLimit) return detail::fail(WSA_IO_PENDING);
+  if (lpNumberOfBytesSent != nullptr) *lpNumberOfBytesSent = static_cast<DWORD>(op->total);
+  return 0;
+}
+
+int WSARecv(SOCKET s, WSABUF* lpBuffers, DWORD dwBufferCount, DWORD* lpNumberOfBytesRecvd, DWORD* lpFlags,
+            WSAOVERLAPPED* lpOverlapped, LPWSAOVERLAPPED_COMPLETION_ROUTINE lpCompletionRoutine) {
+  int result = 0;
+  bool faulted = fault::check(fault::Call::WSARecv, result);
+  std::shared_ptr<detail::SocketState> socket = detail::findSocket(s);
+  if (!socket) return detail::fail(WSAENOTSOCK);
+  if (lpBuffers == nullptr || dwBufferCount == 0 || dwBufferCount > 8) return detail::fail(WSAEINVAL);
+  if (lpOverlapped == nullptr || lpCompletionRoutine == nullptr) return detail::fail(WSAEINVAL);
+  std::lock_guard<std::mutex> hold(socket->lock);
+  if (socket->closed) return detail::fail(WSAENOTSOCK);
+  // Posting a read re-enables FD_READ, whatever comes of it.
+  socket->readEnabled = true;
+  if (faulted && result != WSA_IO_PENDING) return detail::fail(result);
+  detail::Operation* op = detail::makeOperation(false, lpBuffers, dwBufferCount, lpOverlapped, lpCompletionRoutine);
+  if (!faulted && socket->receives.empty()) {
+    ssize_t got = detail::readInto(*socket, *op);
+    if (got >= 0) {
+      if (lpNumberOfBytesRecvd != nullptr) *lpNumberOfBytesRecvd = static_cast<DWORD>(got);
+      if (lpFlags != nullptr) *lpFlags = 0;
+      detail::finish(op, 0, static_cast<DWORD>(got));
+      return 0;
+    }
+    if (errno != EAGAIN && errno != EWOULDBLOCK) {
+      int err = errno;
+      delete op;
+      return detail::failFromErrno(err);
+    }
+  }
+  socket->receives.push_back(op);
+  detail::Reactor::current()->watch(socket);
+  return detail::fail(WSA_IO_PENDING);
+}
+
+}  // namespace platform

@@ -1,0 +1,79 @@
+// The per-thread reactor: completion queue and wake-up descriptor.
+#include "internal.h"  // first: see the note there
+
+#include <sys/eventfd.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cstdlib>
+
+namespace platform::detail {
+
+Reactor::Reactor() {
+  wakeFd_ = ::eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC);
+  if (wakeFd_ < 0) std::abort();  // a thread that can't be woken can't wait safely
+}
+
+Reactor::~Reactor() {
+  // Completions that were never run belong to a thread that has ended; their
+  // records are owned by whoever issued them.
+  ::close(wakeFd_);
+}
+
+namespace {
+thread_local Reactor* t_self = nullptr;
+}  // namespace
+
+const std::shared_ptr<Reactor>& Reactor::current() {
+  thread_local std::shared_ptr<Reactor> reactor = [] {
+    auto r = std::make_shared<Reactor>();
+    t_self = r.get();
+    return r;
+  }();
+  return reactor;
+}
+
+void Reactor::post(const Completion& completion) {
+  {
+    std::lock_guard<std::mutex> hold(lock_);
+    queue_.push_back(completion);
+    pending_.store(true, std::memory_order_release);
+  }
+  // The owner finds its own completions before it sleeps; only other threads
+  // need to knock.
+  if (t_self != this) wake();
+}
+
+bool Reactor::hasCompletions() { return pending_.load(std::memory_order_acquire); }
+
+bool Reactor::runCompletions() {
+  if (!pending_.load(std::memory_order_acquire)) return false;
+  std::vector<Completion> batch;
+  {
+    std::lock_guard<std::mutex> hold(lock_);
+    batch.swap(queue_);
+    pending_.store(false, std::memory_order_relaxed);
+  }
+  // Routines may issue new operations, whose completions queue up for the
+  // next alertable wait rather than running here.
+  for (const Completion& c : batch) c.routine(c.error, c.bytes, c.overlapped, c.flags);
+  return !batch.empty();
+}
+
+void Reactor::wake() {
+  std::uint64_t one = 1;
+  ssize_t rc = ::write(wakeFd_, &one, sizeof one);
+  (void)rc;  // a full counter already means "wake up"
+}
+
+void Reactor::drainWake() {
+  std::uint64_t count;
+  ssize_t rc = ::read(wakeFd_, &count, sizeof count);
+  (void)rc;
+}
+
+void Reactor::watch(const std::shared_ptr<SocketState>& socket) {
+  if (std::find(ioSockets.begin(), ioSockets.end(), socket) == ioSockets.end()) ioSockets.push_back(socket);
+}
+
+}  // namespace platform::detail
