@@ -19,6 +19,8 @@ using WORD = std::uint16_t;
 using DWORD = std::uint32_t;
 using BOOL = int;
 using UINT = unsigned int;
+constexpr BOOL FALSE = 0;
+constexpr BOOL TRUE = 1;
 
 // Handles are opaque values that name entries of the layer's handle tables.
 // They are never dereferenced, and a stale handle is detected, not followed.

@@ -1,0 +1,143 @@
+#include "raw_socket.h"
+
+#include <arpa/inet.h>
+#include <netinet/in.h>
+#include <poll.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <chrono>
+#include <random>
+
+namespace raw {
+namespace {
+
+sockaddr_in address(const char* ip, std::uint16_t port) {
+  sockaddr_in a{};
+  a.sin_family = AF_INET;
+  a.sin_port = htons(port);
+  inet_pton(AF_INET, ip, &a.sin_addr);
+  return a;
+}
+
+bool readable(int fd, int timeoutMs) {
+  pollfd p{fd, POLLIN, 0};
+  return ::poll(&p, 1, timeoutMs) > 0;
+}
+
+bool bindable(int type, std::uint16_t port) {
+  int fd = ::socket(AF_INET, type, 0);
+  sockaddr_in a = address("127.0.0.1", port);
+  bool ok = ::bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof a) == 0;
+  ::close(fd);
+  return ok;
+}
+
+}  // namespace
+
+int listenOn(const char* ip, std::uint16_t& port) {
+  int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  int one = 1;
+  ::setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof one);
+  sockaddr_in a = address(ip, port);
+  if (::bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof a) != 0 || ::listen(fd, 64) != 0) {
+    ::close(fd);
+    return -1;
+  }
+  socklen_t len = sizeof a;
+  ::getsockname(fd, reinterpret_cast<sockaddr*>(&a), &len);
+  port = ntohs(a.sin_port);
+  return fd;
+}
+
+int acceptOne(int listener, int timeoutMs) {
+  if (!readable(listener, timeoutMs)) return -1;
+  return ::accept4(listener, nullptr, nullptr, SOCK_CLOEXEC);
+}
+
+int connectTo(const char* ip, std::uint16_t port) {
+  int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_in a = address(ip, port);
+  if (::connect(fd, reinterpret_cast<sockaddr*>(&a), sizeof a) != 0) {
+    ::close(fd);
+    return -1;
+  }
+  return fd;
+}
+
+bool sendAll(int fd, const void* data, std::size_t size) {
+  const char* p = static_cast<const char*>(data);
+  while (size > 0) {
+    ssize_t n = ::send(fd, p, size, MSG_NOSIGNAL);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) return false;
+    p += n;
+    size -= static_cast<std::size_t>(n);
+  }
+  return true;
+}
+
+bool receiveExactly(int fd, void* data, std::size_t size, int timeoutMs) {
+  char* p = static_cast<char*>(data);
+  auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMs);
+  while (size > 0) {
+    auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now()).count();
+    if (left <= 0 || !readable(fd, static_cast<int>(left))) return false;
+    ssize_t n = ::recv(fd, p, size, 0);
+    if (n <= 0) return false;
+    p += n;
+    size -= static_cast<std::size_t>(n);
+  }
+  return true;
+}
+
+std::vector<std::uint8_t> receiveFor(int fd, int timeoutMs) {
+  std::vector<std::uint8_t> out;
+  auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMs);
+  std::uint8_t buffer[65536];
+  for (;;) {
+    auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now()).count();
+    if (left <= 0 || !readable(fd, static_cast<int>(left))) break;
+    ssize_t n = ::recv(fd, buffer, sizeof buffer, 0);
+    if (n <= 0) break;
+    out.insert(out.end(), buffer, buffer + n);
+  }
+  return out;
+}
+
+void reset(int fd) {
+  linger hard{1, 0};
+  ::setsockopt(fd, SOL_SOCKET, SO_LINGER, &hard, sizeof hard);
+  ::close(fd);
+}
+
+void closeFd(int fd) {
+  if (fd >= 0) ::close(fd);
+}
+
+int udpBound(const char* ip, std::uint16_t port) {
+  int fd = ::socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+  int one = 1;
+  ::setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof one);
+  sockaddr_in a = address(ip, port);
+  if (::bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof a) != 0) {
+    ::close(fd);
+    return -1;
+  }
+  return fd;
+}
+
+std::uint16_t freePort(bool pairWithNext) {
+  std::mt19937 pick(static_cast<unsigned>(std::chrono::steady_clock::now().time_since_epoch().count() ^ ::getpid()));
+  for (int attempt = 0; attempt < 1000; ++attempt) {
+    auto port = static_cast<std::uint16_t>(20000 + pick() % 30000);
+    if (port == 6000 || port == 5999) continue;
+    bool ok = bindable(SOCK_STREAM, port) && bindable(SOCK_DGRAM, port);
+    if (ok && pairWithNext) ok = bindable(SOCK_STREAM, port + 1) && bindable(SOCK_DGRAM, port + 1);
+    if (ok) return port;
+  }
+  return 0;
+}
+
+}  // namespace raw

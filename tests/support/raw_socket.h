@@ -1,0 +1,33 @@
+// Plain Linux TCP sockets for tests that play a peer outside the library
+// (reading and writing the stream byte by byte, resetting connections).
+// Kept apart from the Winsock-shaped headers, whose names Linux's macros
+// would clash with.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <string>
+#include <vector>
+
+namespace raw {
+
+// A listening socket on `ip`, port chosen by the system unless given.
+int listenOn(const char* ip, std::uint16_t& port);
+// Accepts one connection within `timeoutMs`; -1 on time-out.
+int acceptOne(int listener, int timeoutMs);
+// A blocking connect; -1 on failure.
+int connectTo(const char* ip, std::uint16_t port);
+bool sendAll(int fd, const void* data, std::size_t size);
+// Reads exactly `size` bytes within `timeoutMs`; false on time-out or close.
+bool receiveExactly(int fd, void* data, std::size_t size, int timeoutMs);
+// Reads whatever arrives within `timeoutMs` (until the peer closes or time ends).
+std::vector<std::uint8_t> receiveFor(int fd, int timeoutMs);
+// Closes with RST instead of FIN.
+void reset(int fd);
+void closeFd(int fd);
+// A UDP socket bound to ip:port; -1 on failure.
+int udpBound(const char* ip, std::uint16_t port);
+// A free port on 127.0.0.1 for both TCP and UDP (and for port + 1 when asked).
+std::uint16_t freePort(bool pairWithNext = false);
+
+}  // namespace raw
