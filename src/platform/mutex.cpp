@@ -14,6 +14,21 @@ namespace {
 struct MutexObject {
   pthread_mutex_t mutex;
   std::string name;
+  // The owner is tracked here so that a release by another thread is refused
+  // without ever calling pthread_mutex_unlock for it.
+  std::atomic<pthread_t> owner{};
+  std::atomic<bool> owned{false};
+  int depth = 0;  // touched by the owner only
+
+  void acquired() {
+    if (depth++ == 0) {
+      owner.store(pthread_self(), std::memory_order_relaxed);
+      owned.store(true, std::memory_order_relaxed);
+    }
+  }
+  bool ownedByCaller() const {
+    return owned.load(std::memory_order_relaxed) && pthread_equal(owner.load(std::memory_order_relaxed), pthread_self());
+  }
   MutexObject() {
     pthread_mutexattr_t attributes;
     pthread_mutexattr_init(&attributes);
@@ -70,7 +85,7 @@ HANDLE CreateMutexA(SECURITY_ATTRIBUTES*, BOOL bInitialOwner, const char* lpName
   } else {
     object = std::make_shared<detail::MutexObject>();
   }
-  if (bInitialOwner) pthread_mutex_lock(&object->mutex);
+  if (bInitialOwner && pthread_mutex_lock(&object->mutex) == 0) object->acquired();
   auto handle = std::make_shared<detail::MutexHandle>();
   handle->object = std::move(object);
   return detail::toHandle(detail::mutexTable().insert(std::move(handle)));
@@ -82,11 +97,18 @@ DWORD WaitForSingleObject(HANDLE hHandle, DWORD dwMilliseconds) {
     detail::fail(WSA_INVALID_HANDLE);
     return WAIT_FAILED;
   }
-  pthread_mutex_t* mutex = &handle->object->mutex;
+  detail::MutexObject& object = *handle->object;
+  pthread_mutex_t* mutex = &object.mutex;
   if (dwMilliseconds == INFINITE) {
-    return pthread_mutex_lock(mutex) == 0 ? WAIT_OBJECT_0 : WAIT_FAILED;
+    if (pthread_mutex_lock(mutex) != 0) return WAIT_FAILED;
+    object.acquired();
+    return WAIT_OBJECT_0;
   }
-  if (dwMilliseconds == 0) return pthread_mutex_trylock(mutex) == 0 ? WAIT_OBJECT_0 : WAIT_TIMEOUT;
+  if (dwMilliseconds == 0) {
+    if (pthread_mutex_trylock(mutex) != 0) return WAIT_TIMEOUT;
+    object.acquired();
+    return WAIT_OBJECT_0;
+  }
   timespec deadline;
   clock_gettime(CLOCK_REALTIME, &deadline);
   deadline.tv_sec += dwMilliseconds / 1000;
@@ -96,7 +118,10 @@ DWORD WaitForSingleObject(HANDLE hHandle, DWORD dwMilliseconds) {
     deadline.tv_nsec -= 1000000000L;
   }
   int rc = pthread_mutex_timedlock(mutex, &deadline);
-  if (rc == 0) return WAIT_OBJECT_0;
+  if (rc == 0) {
+    object.acquired();
+    return WAIT_OBJECT_0;
+  }
   return rc == ETIMEDOUT ? WAIT_TIMEOUT : WAIT_FAILED;
 }
 
@@ -106,12 +131,13 @@ BOOL ReleaseMutex(HANDLE hMutex) {
     detail::fail(WSA_INVALID_HANDLE);
     return 0;
   }
-  // A recursive pthread mutex refuses an unlock by a thread that doesn't own
-  // it (EPERM), which is exactly Win32's rule.
-  if (pthread_mutex_unlock(&handle->object->mutex) != 0) {
+  detail::MutexObject& object = *handle->object;
+  if (!object.ownedByCaller()) {
     detail::fail(WSAEACCES);
     return 0;
   }
+  if (--object.depth == 0) object.owned.store(false, std::memory_order_relaxed);
+  pthread_mutex_unlock(&object.mutex);
   return 1;
 }
 
