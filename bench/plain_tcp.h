@@ -1,0 +1,33 @@
+// The baseline: a plain TCP socket pair on loopback with the same 4-byte
+// little-endian length prefix, written without the library.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <vector>
+
+namespace bench {
+
+struct Throughput {
+  double messagesPerSecond = 0;
+  double megabytesPerSecond = 0;
+  bool verified = false;
+};
+
+struct Latency {
+  double medianMicros = 0;
+  double p99Micros = 0;
+};
+
+// Fills `out` with the pattern of message `index`; checks it on the way in.
+void fillMessage(std::vector<std::uint8_t>& out, std::size_t size, std::uint64_t index);
+bool checkMessage(const std::uint8_t* data, std::size_t size, std::uint64_t index);
+Latency summarize(std::vector<double>& micros);
+
+// One send() per message (prefix and payload in one call), reads of 64 KiB.
+Throughput plainThroughput(std::size_t size, std::size_t count);
+Latency plainRoundTrip(std::size_t size, int rounds);
+
+std::uint16_t freePort();
+
+}  // namespace bench
