@@ -1,0 +1,34 @@
+// The demo program: the library's public interface at work.
+#pragma once
+
+#include <string>
+#include <vector>
+
+namespace demo {
+
+struct Options {
+  std::string mode = "world";        // world | server | client | transport | resolve
+  std::vector<std::string> args;     // positional arguments after the mode
+  std::string host;                  // this process's own host (loopback address)
+  int port = 3123;
+  int clients = 4;
+  double seconds = 20.0;             // 0: run until interrupted
+  float loss = 0.0f;                 // simulated loss of unreliable messages
+  unsigned delayMin = 0, delayMax = 0;  // simulated read delay, milliseconds
+  bool verbose = false;
+};
+
+int runResolve(const Options& options);
+int runTransport(const Options& options);
+int runWorld(const Options& options);
+int runServer(const Options& options);
+int runClient(const Options& options);
+
+// Process helpers (Linux): start this program again with other arguments.
+int spawnSelf(const std::vector<std::string>& args, bool quiet);
+// Waits up to graceMs for the child to end by itself, then stops it.
+void stopChild(int pid, int graceMs = 0);
+bool stopRequested();
+void installStopHandler();
+
+}  // namespace demo
