@@ -185,14 +185,16 @@ int runClient(const Options& options) {
     bool connected = false;
     unsigned seen = 0;
     auto nextStatus = start;
+    auto nextAttempt = start;
     double phase = (me[std::strlen(me) - 1] - '0') * 0.7;
     while (!stopRequested()) {
       auto tick = Clock::now();
       double t = std::chrono::duration<double>(tick - start).count();
       if (options.seconds > 0 && t > options.seconds) break;
-      if (!client.isConstructed() || (!connected && t > 2.0 && !client.isConnected() && static_cast<int>(t * 10) % 20 == 0)) {
-        // The server may not be up yet: try again every two seconds.
+      if (!connected && tick >= nextAttempt && !client.isConnected()) {
+        // The server may not be up yet: try again each second until it answers.
         client.construct(&server, options.port);
+        nextAttempt = tick + std::chrono::seconds(1);
       }
       client.update();
       if (!client.isConnected()) {
