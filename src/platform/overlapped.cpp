@@ -101,6 +101,7 @@ void progressStreamSends(SocketState& socket) {
 
 void progressDatagramSends(SocketState& socket) {
   iovec iov[8];
+  int refusals = 0;
   while (!socket.sends.empty()) {
     Operation* op = socket.sends.front();
     int n = gather(*op, iov, 8);
@@ -116,7 +117,7 @@ void progressDatagramSends(SocketState& socket) {
       }
       // A port-unreachable report from an earlier datagram surfaces here;
       // it says nothing about this one, so send it again.
-      if (errno == ECONNREFUSED) continue;
+      if (errno == ECONNREFUSED && ++refusals < 8) continue;
       int err = errno;
       socket.sends.pop_front();
       socket.unflushed -= op->total;
@@ -137,12 +138,13 @@ ssize_t readInto(SocketState& socket, Operation& op) {
   msghdr message{};
   message.msg_iov = iov;
   message.msg_iovlen = static_cast<std::size_t>(n);
-  for (;;) {
+  for (int refusals = 0;;) {
     ssize_t got = ::recvmsg(socket.fd, &message, MSG_DONTWAIT);
     if (got >= 0) return got;
     if (errno == EINTR) continue;
     // ICMP noise on datagram sockets: drop it and look again.
-    if (errno == ECONNREFUSED && socket.type == wsa::sockDgram) continue;
+    if (errno == ECONNREFUSED && socket.type == wsa::sockDgram && ++refusals < 8) continue;
+    if (errno == ECONNREFUSED && socket.type == wsa::sockDgram) errno = EAGAIN;
     return -1;
   }
 }
