@@ -82,7 +82,10 @@ bench::Latency payloadRoundTrip(int rounds) {
   return bench::summarize(micros);
 }
 
-// One of the 20 clients, in a process of its own.
+}  // namespace
+
+// One of the 20 clients, in a process of its own (started by exec, so that it
+// has a runtime of its own).
 int clientPeer(const char* host, int port, double seconds) {
   platform::setLocalHost(host);
   N_Initializer network;
@@ -105,14 +108,22 @@ int clientPeer(const char* host, int port, double seconds) {
   return 0;
 }
 
+namespace {
+
 void twentyClients(double seconds) {
   int port = bench::freePort();
   N_Server server(port);
   std::vector<pid_t> children;
   for (int i = 0; i < 20; ++i) {
     std::string host = "127.0.0." + std::to_string(i + 2);
+    std::string portText = std::to_string(port);
+    std::string secondsText = std::to_string(seconds);
     pid_t pid = fork();
-    if (pid == 0) _exit(clientPeer(host.c_str(), port, seconds));
+    if (pid == 0) {
+      execl("/proc/self/exe", "vardel_bench", "--client-peer", host.c_str(), portText.c_str(), secondsText.c_str(),
+            static_cast<char*>(nullptr));
+      _exit(127);
+    }
     children.push_back(pid);
   }
   std::vector<N_Client*> clients;

@@ -2,3 +2,6 @@
 #pragma once
 
 void benchClientServer(bool quick);
+
+// The body of one client process of the 20-client measurement.
+int clientPeer(const char* host, int port, double seconds);

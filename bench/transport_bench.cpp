@@ -9,6 +9,7 @@
 #include <chrono>
 #include <condition_variable>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <mutex>
 #include <string>
@@ -144,6 +145,8 @@ bench::Latency libraryRoundTrip(std::size_t size, int rounds) {
 }  // namespace
 
 int main(int argc, char** argv) {
+  if (argc == 5 && std::strcmp(argv[1], "--client-peer") == 0)
+    return clientPeer(argv[2], std::atoi(argv[3]), std::atof(argv[4]));
   bool quick = argc > 1 && std::strcmp(argv[1], "--quick") == 0;
   N_Initializer network;
   std::printf("Transport: one-way throughput over loopback, every message checked\n");
