@@ -1,0 +1,112 @@
+#include "N_Listener.h"
+
+#include <cstring>
+
+#include "N_Initializer.h"
+#include "win32.h"
+#include "winsock.h"
+
+using namespace platform;
+
+namespace {
+
+constexpr int kBufferSize = 65536;
+
+void setIntOption(SOCKET s, int option, int value) {
+  setsockopt(s, SOL_SOCKET, option, reinterpret_cast<const char*>(&value), sizeof value);
+}
+
+}  // namespace
+
+N_Listener::N_Listener(int port) {
+  initializeMembers();
+  construct(port);
+}
+
+N_Listener::~N_Listener() { destruct(); }
+
+void N_Listener::initializeMembers() {
+  m_bConstructed = false;
+  m_iPort = 0;
+  m_socket = 0;
+  m_event = nullptr;
+  std::memset(&m_requestedAddress, 0, sizeof m_requestedAddress);
+  std::memset(&m_localAddress, 0, sizeof m_localAddress);
+  m_pRegistryEntry = nullptr;
+}
+
+bool N_Listener::isConstructed() const { return m_bConstructed; }
+
+void N_Listener::construct(int port) {
+  if (m_bConstructed) destruct();
+  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  N_Initializer::releaseThreadLoop();
+  m_iPort = port;
+  m_event = WSACreateEvent();
+  WSAPROTOCOL_INFOA* provider = N_Initializer::m_tcpProtocol;
+  m_requestedAddress.sin_family = static_cast<std::uint16_t>(provider != nullptr ? provider->iAddressFamily : AF_INET);
+  m_requestedAddress.sin_port = htons(static_cast<std::uint16_t>(port));
+  m_requestedAddress.sin_addr.s_addr = INADDR_ANY;
+  m_localAddress = m_requestedAddress;
+  m_socket = N_Socket::chkErr(
+      WSASocketA(FROM_PROTOCOL_INFO, FROM_PROTOCOL_INFO, FROM_PROTOCOL_INFO, provider, 0, WSA_FLAG_OVERLAPPED));
+  setIntOption(m_socket, SO_RCVBUF, kBufferSize);
+  setIntOption(m_socket, SO_SNDBUF, kBufferSize);
+  setIntOption(m_socket, SO_REUSEADDR, 1);
+  // Selected before bind and listen; the network thread only waits on the
+  // event once the registry below has it.
+  N_Socket::chkErr(WSAEventSelect(m_socket, m_event, FD_ACCEPT));
+  N_Socket::chkErr(bind(m_socket, reinterpret_cast<const sockaddr*>(&m_localAddress), sizeof m_localAddress));
+  N_Socket::chkErr(listen(m_socket, SOMAXCONN));
+  int length = sizeof m_localAddress;
+  N_Socket::chkErr(getsockname(m_socket, reinterpret_cast<sockaddr*>(&m_localAddress), &length));
+  try {
+    N_Listener** slot = N_Initializer::m_pListeners->append();
+    *slot = this;
+    m_pRegistryEntry = slot;
+  } catch (...) {
+    // Nothing of the attempt stays: the object is left unconstructed.
+    N_Socket::chkErr(closesocket(m_socket));
+    WSACloseEvent(m_event);
+    initializeMembers();
+    ReleaseMutex(N_Initializer::m_hMutex);
+    throw;
+  }
+  N_Initializer::releaseThreadLoop();
+  m_bConstructed = true;
+  ReleaseMutex(N_Initializer::m_hMutex);
+}
+
+void N_Listener::destruct() {
+  if (!m_bConstructed) return;
+  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  N_Initializer::releaseThreadLoop();
+  N_Socket::chkErr(closesocket(m_socket));
+  WSACloseEvent(m_event);
+  if (m_pRegistryEntry != nullptr && N_Initializer::m_pListeners != nullptr)
+    N_Initializer::m_pListeners->remove(m_pRegistryEntry);
+  N_Initializer::releaseThreadLoop();
+  initializeMembers();
+  ReleaseMutex(N_Initializer::m_hMutex);
+}
+
+int N_Listener::getPort() { return m_iPort; }
+
+bool N_Listener::pollConnect(N_Socket::ConnectData*& out) {
+  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  bool found = false;
+  Q_DLList<N_Socket::ConnectData>* queue = N_Initializer::m_pConnectQueue;
+  if (queue != nullptr) {
+    for (N_Socket::ConnectData* entry = queue->getFirst(); entry != nullptr; entry = queue->getNext(entry)) {
+      if (entry->pListener == this) {
+        out = entry;
+        found = true;
+        break;
+      }
+    }
+  }
+  ReleaseMutex(N_Initializer::m_hMutex);
+  return found;
+}
+
+void N_Listener::receiveConnect(N_Socket::ConnectData*) {}

@@ -1,0 +1,64 @@
+// A TCP listening socket on a port of all local addresses.
+//
+// The listener accepts nothing itself: the runtime's network thread accepts
+// on its behalf and leaves each connection as an N_Socket::ConnectData in the
+// runtime's connect queue, oldest first. pollConnect() finds the oldest entry
+// of this listener without taking it out; hand it to N_Socket (or N_Client)
+// exactly once, which consumes it, then poll again. An entry nobody consumes
+// hides the later entries of the same listener.
+//
+// No socket failure is reported: a listener whose bind or listen failed
+// (a port in use, say) simply never gets a connection.
+//
+// Copying is forbidden: two objects would own one socket, event and registry
+// entry.
+#pragma once
+
+#include "N_Socket.h"
+#include "vardel_export.h"
+#include "vardel_platform.h"
+
+class N_Initializer;
+
+class VARDEL_API N_Listener {
+ public:
+  explicit N_Listener(int port = 3123);
+  ~N_Listener();
+
+  N_Listener(const N_Listener&) = delete;
+  N_Listener& operator=(const N_Listener&) = delete;
+
+  // Opens the port (on a constructed listener: closes the old one first).
+  // Throws Q_MemoryException_Allocation* if the registry entry can't be made;
+  // the object is then unconstructed and nothing of the attempt is left.
+  void construct(int port);
+  // Closes the port. Entries of this listener that were never consumed stay
+  // in the connect queue until the runtime stops.
+  void destruct();
+
+  // The port as given to construct(); 0 stays 0 even though the system chose
+  // one.
+  int getPort();
+  // The oldest accepted connection of this listener, left in the queue.
+  // False, with `out` untouched, if there is none.
+  bool pollConnect(N_Socket::ConnectData*& out);
+
+  // Called on the network thread, with the runtime's mutex held, once for
+  // each accepted connection after its entry is queued. Nothing here. An
+  // override must not wait for a thread that needs the runtime's mutex.
+  virtual void receiveConnect(N_Socket::ConnectData* data);
+
+ private:
+  friend class N_Initializer;
+
+  void initializeMembers();
+  bool isConstructed() const;
+
+  bool m_bConstructed;
+  int m_iPort;
+  platform::SOCKET m_socket;
+  platform::WSAEVENT m_event;
+  platform::sockaddr_in m_requestedAddress;
+  platform::sockaddr_in m_localAddress;
+  N_Listener** m_pRegistryEntry;
+};

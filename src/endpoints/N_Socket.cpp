@@ -1,0 +1,392 @@
+// N_Socket: the object, its life, the events and the queries. The send path
+// is in socket_send.cpp, the receive path in socket_receive.cpp.
+#include "N_Socket.h"
+
+#include <cfloat>
+#include <cstring>
+
+#include "N_Address.h"
+#include "N_Exceptions.h"
+#include "N_Initializer.h"
+#include "Q_New.h"
+#include "Q_Throw.h"
+#include "win32.h"
+#include "winsock.h"
+
+using namespace platform;
+
+namespace {
+
+// FD_READ | FD_WRITE | FD_CONNECT | FD_CLOSE
+constexpr long kSocketEvents = 51;
+constexpr int kBufferSize = 65536;
+
+void setIntOption(SOCKET s, int option, int value) {
+  setsockopt(s, SOL_SOCKET, option, reinterpret_cast<const char*>(&value), sizeof value);
+}
+
+}  // namespace
+
+N_Socket::N_Socket() : m_remoteAddress{}, m_localAddress{} { initializeMembers(); }
+
+N_Socket::N_Socket(ConnectData* data) : m_remoteAddress{}, m_localAddress{} {
+  initializeMembers();
+  construct(data);
+}
+
+N_Socket::N_Socket(const N_Address* address, int port, SocketType type) : m_remoteAddress{}, m_localAddress{} {
+  initializeMembers();
+  construct(address, port, type);
+}
+
+N_Socket::~N_Socket() { destruct(); }
+
+bool N_Socket::isConstructed() const { return m_bConstructed; }
+
+void N_Socket::initializeMembers() {
+  m_bConstructed = false;
+  m_pReceiveQueue = nullptr;
+  m_pAddress = nullptr;
+  m_iPort = 0;
+  m_socketType = SOCKET_TCP;
+  m_socket = 0;
+  m_event = nullptr;
+  m_pRegistryEntry = nullptr;
+  m_iMaximumSendPacketSize = kBufferSize;
+  m_bConnected = false;
+  m_bEventPending = false;
+  m_bOwnsAddress = false;
+  m_bWritable = false;
+  m_bWriteCompletionPending = false;
+  m_bPackage = false;
+  m_iPacketBytesMissing = 0;
+  m_iPacketBytesHave = 0;
+  m_pPacketBuffer = nullptr;
+  m_bStreamBroken = false;
+  m_pDelivering = nullptr;
+}
+
+void N_Socket::baseConstructor() {
+  m_pReceiveQueue = Q_New<Q_DLList<DataQueue>>();
+  m_pAddress = nullptr;
+  m_iPort = 0;
+  m_socketType = SOCKET_TCP;
+  m_bConnected = false;
+  m_bOwnsAddress = false;
+  m_bWritable = false;
+  m_bWriteCompletionPending = false;
+  m_iPacketBytesMissing = 0;
+  m_iPacketBytesHave = 0;
+  m_bStreamBroken = false;
+  m_bConstructed = true;
+  m_bPackage = true;
+  std::memset(&m_remoteAddress, 0, sizeof m_remoteAddress);
+  std::memset(&m_localAddress, 0, sizeof m_localAddress);
+  m_event = WSACreateEvent();
+}
+
+void N_Socket::construct(ConnectData* data) {
+  destruct();
+  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  try {
+    baseConstructor();
+    m_remoteAddress = data->address;
+    m_bConnected = true;
+    m_socket = data->socket;
+    setIntOption(m_socket, SO_RCVBUF, kBufferSize);
+    setIntOption(m_socket, SO_SNDBUF, kBufferSize);
+    int limit = 0;
+    int length = sizeof limit;
+    if (getsockopt(m_socket, SOL_SOCKET, SO_SNDBUF, reinterpret_cast<char*>(&limit), &length) == 0)
+      m_iMaximumSendPacketSize = limit;
+    m_pAddress = Q_New<N_Address>(inet_ntoa(m_remoteAddress.sin_addr));
+    m_bOwnsAddress = true;
+    m_iPort = ntohs(m_remoteAddress.sin_port);
+    m_socketType = SOCKET_TCP;
+    chkErr(WSAEventSelect(m_socket, m_event, kSocketEvents));
+    length = sizeof m_localAddress;
+    chkErr(getsockname(m_socket, reinterpret_cast<sockaddr*>(&m_localAddress), &length));
+    // Register before the entry goes, so that a failed registration leaves
+    // the entry queued (its socket closed by the clean-up below).
+    N_Socket** slot = N_Initializer::m_pSockets->append();
+    *slot = this;
+    m_pRegistryEntry = slot;
+    N_Initializer::m_pConnectQueue->remove(data);
+    N_Initializer::releaseThreadLoop();
+    ReleaseMutex(N_Initializer::m_hMutex);
+  } catch (...) {
+    ReleaseMutex(N_Initializer::m_hMutex);
+    destruct();
+    throw;
+  }
+}
+
+void N_Socket::construct(const N_Address* address, int port, SocketType type) {
+  destruct();
+  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  N_Initializer::releaseThreadLoop();
+  try {
+    baseConstructor();
+    m_pAddress = address;
+    m_iPort = port;
+    m_socketType = type;
+    WSAPROTOCOL_INFOA* provider = N_Initializer::m_tcpProtocol;
+    if (type == SOCKET_UDP) {
+      provider = N_Initializer::m_udpProtocol;
+      m_bConnected = true;
+      m_bPackage = false;
+    }
+    std::uint16_t family = static_cast<std::uint16_t>(provider != nullptr ? provider->iAddressFamily : AF_INET);
+    m_remoteAddress.sin_family = family;
+    m_remoteAddress.sin_port = htons(static_cast<std::uint16_t>(port));
+    unsigned int identifier = address != nullptr ? address->getIdentifier() : 0;
+    if (identifier == 0) Q_Throw<N_NetException_IPNotResolved>();
+    m_remoteAddress.sin_addr.s_addr = identifier;
+    m_localAddress.sin_family = family;
+    m_localAddress.sin_port = type == SOCKET_UDP ? htons(static_cast<std::uint16_t>(port)) : 0;
+    const N_Address* local = N_Address::getLocalAddress();
+    m_localAddress.sin_addr.s_addr = local != nullptr ? local->getIdentifier() : 0;
+    m_socket = chkErr(WSASocketA(FROM_PROTOCOL_INFO, FROM_PROTOCOL_INFO, FROM_PROTOCOL_INFO, provider, 0,
+                                 WSA_FLAG_OVERLAPPED));
+    chkErr(WSAEventSelect(m_socket, m_event, kSocketEvents));
+    setIntOption(m_socket, SO_RCVBUF, kBufferSize);
+    setIntOption(m_socket, SO_SNDBUF, kBufferSize);
+    setIntOption(m_socket, SO_REUSEADDR, 1);
+    int limit = 0;
+    int length = sizeof limit;
+    if (getsockopt(m_socket, SOL_SOCKET, type == SOCKET_UDP ? SO_MAX_MSG_SIZE : SO_SNDBUF,
+                   reinterpret_cast<char*>(&limit), &length) == 0)
+      m_iMaximumSendPacketSize = limit;
+    if (bind(m_socket, reinterpret_cast<const sockaddr*>(&m_localAddress), sizeof m_localAddress) == SOCKET_ERROR &&
+        WSAGetLastError() == WSAEADDRINUSE)
+      Q_Throw<N_NetException_LocalAddressAlreadyInUse>();
+    if (WSAConnect(m_socket, reinterpret_cast<const sockaddr*>(&m_remoteAddress), sizeof m_remoteAddress, nullptr,
+                   nullptr, nullptr, nullptr) == SOCKET_ERROR &&
+        WSAGetLastError() == WSAEADDRINUSE)
+      Q_Throw<N_NetException_LocalAddressAlreadyInUse>();
+    length = sizeof m_localAddress;
+    chkErr(getsockname(m_socket, reinterpret_cast<sockaddr*>(&m_localAddress), &length));
+    N_Socket** slot = N_Initializer::m_pSockets->append();
+    *slot = this;
+    m_pRegistryEntry = slot;
+    N_Initializer::releaseThreadLoop();
+    ReleaseMutex(N_Initializer::m_hMutex);
+  } catch (...) {
+    ReleaseMutex(N_Initializer::m_hMutex);
+    destruct();
+    throw;
+  }
+}
+
+void N_Socket::destruct() {
+  if (!m_bConstructed) return;
+  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  N_Initializer::releaseThreadLoop();
+  awaitDelivery();
+  chkErr(WSAEventSelect(m_socket, m_event, 0));
+  WSACloseEvent(m_event);
+  if (m_socket != 0) chkErr(closesocket(m_socket));
+  // Entries in flight become orphans: Winsock may still name their
+  // overlapped, so only the network side may free them.
+  for (auto* queue : {N_Initializer::m_pInProcessQueue, N_Initializer::m_pOutProcessQueue}) {
+    if (queue == nullptr) continue;
+    for (DataQueue* entry = queue->getFirst(); entry != nullptr; entry = queue->getNext(entry)) {
+      if (entry->pSocket == this) {
+        entry->bLive = false;
+        entry->pSocket = nullptr;
+      }
+    }
+  }
+  if (m_pReceiveQueue != nullptr) {
+    for (DataQueue* entry = m_pReceiveQueue->getFirst(); entry != nullptr; entry = m_pReceiveQueue->getNext(entry))
+      Q_DeleteArray(entry->pBuffer);
+    Q_Delete(m_pReceiveQueue);
+    m_pReceiveQueue = nullptr;
+  }
+  Q_DeleteArray(m_pPacketBuffer);
+  m_pPacketBuffer = nullptr;
+  if (m_bOwnsAddress && m_pAddress != nullptr) Q_Delete(const_cast<N_Address*>(m_pAddress));
+  m_pAddress = nullptr;
+  if (m_pRegistryEntry != nullptr && N_Initializer::m_pSockets != nullptr)
+    N_Initializer::m_pSockets->remove(m_pRegistryEntry);
+  m_pRegistryEntry = nullptr;
+  initializeMembers();
+  ReleaseMutex(N_Initializer::m_hMutex);
+}
+
+void N_Socket::disconnect() {
+  // One event, whichever of the application and FD_CLOSE comes first.
+  if (!m_bConnected.exchange(false)) return;
+  WSASendDisconnect(m_socket, nullptr);
+  bool keep = true;
+  try {
+    keep = receiveDisconnect();
+  } catch (...) {
+    m_bEventPending = true;
+    throw;
+  }
+  if (keep) m_bEventPending = true;
+}
+
+bool N_Socket::poll(void*& data, unsigned int& size) {
+  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  bool found = false;
+  if (m_pReceiveQueue != nullptr) {
+    DataQueue* entry = m_pReceiveQueue->getFirst();
+    while (entry != nullptr) {
+      DataQueue* next = m_pReceiveQueue->getNext(entry);
+      if (!entry->bConsumed) {
+        data = entry->wsaBuf.buf;
+        size = entry->wsaBuf.len;
+        entry->bConsumed = true;
+        found = true;
+        break;
+      }
+      // A message whose receive() call still runs stays until it returns.
+      if (entry != m_pDelivering) {
+        Q_DeleteArray(entry->pBuffer);
+        m_pReceiveQueue->remove(entry);
+      }
+      entry = next;
+    }
+  }
+  ReleaseMutex(N_Initializer::m_hMutex);
+  return found;
+}
+
+const N_Address* N_Socket::getAddress() { return m_pAddress; }
+
+N_Socket::SocketType N_Socket::getSocketType() { return m_socketType; }
+
+int N_Socket::getPort() { return m_iPort; }
+
+int N_Socket::getMaximumSendPacketSize() const { return m_iMaximumSendPacketSize; }
+
+bool N_Socket::isConnected() { return m_bConnected; }
+
+void N_Socket::enablePackage() { m_bPackage = true; }
+
+void N_Socket::disablePackage() { m_bPackage = false; }
+
+int N_Socket::getReceivePacketSize() const {
+  int missing = m_iPacketBytesMissing;
+  return missing > 0 ? m_iPacketBytesHave + missing : 0;
+}
+
+int N_Socket::getReceivePacketBytesMissing() const {
+  int missing = m_iPacketBytesMissing;
+  return missing > 0 ? missing : 0;
+}
+
+int N_Socket::getBytesWaitingForSend() const {
+  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  unsigned int sum = 0;
+  if (N_Initializer::m_pOutProcessQueue != nullptr) {
+    Q_DLList<DataQueue>* queue = N_Initializer::m_pOutProcessQueue;
+    for (DataQueue* entry = queue->getFirst(); entry != nullptr; entry = queue->getNext(entry))
+      sum += entry->wsaBuf.len;
+  }
+  ReleaseMutex(N_Initializer::m_hMutex);
+  return static_cast<int>(sum);
+}
+
+N_Socket** N_Socket::getFirstSocket() {
+  return N_Initializer::m_pSockets != nullptr ? N_Initializer::m_pSockets->getFirst() : nullptr;
+}
+
+N_Socket** N_Socket::getNextSocket(N_Socket** socket) {
+  return N_Initializer::m_pSockets != nullptr ? N_Initializer::m_pSockets->getNext(socket) : nullptr;
+}
+
+bool N_Socket::pollEvent(const N_Socket*& socket, bool connected) {
+  if (N_Initializer::m_pSockets == nullptr) return false;
+  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  bool found = false;
+  Q_DLList<N_Socket*>* sockets = N_Initializer::m_pSockets;
+  for (N_Socket** slot = sockets->getFirst(); slot != nullptr; slot = sockets->getNext(slot)) {
+    N_Socket* candidate = *slot;
+    if (candidate == nullptr || !candidate->m_bEventPending || candidate->m_bConnected != connected) continue;
+    candidate->m_bEventPending = false;
+    socket = candidate;
+    found = true;
+    break;
+  }
+  ReleaseMutex(N_Initializer::m_hMutex);
+  return found;
+}
+
+bool N_Socket::pollConnect(const N_Socket*& socket) { return pollEvent(socket, true); }
+
+bool N_Socket::pollDisconnect(const N_Socket*& socket) { return pollEvent(socket, false); }
+
+bool N_Socket::networkPresent() { return N_Initializer::m_uInstance > 0; }
+
+float N_Socket::ping(N_Address*) { return FLT_MAX; }
+
+bool N_Socket::receiveConnect() { return true; }
+
+bool N_Socket::receiveDisconnect() { return true; }
+
+bool N_Socket::receive(void*, unsigned int) { return true; }
+
+int N_Socket::chkErr(int result) { return result; }
+
+SOCKET N_Socket::chkErr(SOCKET result) { return result; }
+
+const char* N_Socket::getWSErrorName(int code) {
+  switch (code) {
+    case 6: return "WSA_INVALID_HANDLE";
+    case 8: return "WSA_NOT_ENOUGH_MEMORY";
+    case 87: return "WSA_INVALID_PARAMETER";
+    case 995: return "WSA_OPERATION_ABORTED";
+    case 996: return "WSA_IO_INCOMPLETE";
+    case 997: return "WSA_IO_PENDING";
+    case 10004: return "WSAEINTR";
+    case 10013: return "WSAEACCES";
+    case 10014: return "WSAEFAULT";
+    case 10022: return "WSAEINVAL";
+    case 10024: return "WSAEMFILE";
+    case 10035: return "WSAEWOULDBLOCK";
+    case 10036: return "WSAEINPROGRESS";
+    case 10037: return "WSAEALREADY";
+    case 10038: return "WSAENOTSOCK";
+    case 10039: return "WSAEDESTADDRREQ";
+    case 10040: return "WSAEMSGSIZE";
+    case 10041: return "WSAEPROTOTYPE";
+    case 10042: return "WSAENOPROTOOPT";
+    case 10043: return "WSAEPROTONOSUPPORT";
+    case 10044: return "WSAESOCKTNOSUPPORT";
+    case 10045: return "WSAEOPNOTSUPP";
+    case 10046: return "WSAEPFNOSUPPORT";
+    case 10047: return "WSAEAFNOSUPPORT";
+    case 10048: return "WSAEADDRINUSE";
+    case 10049: return "WSAEADDRNOTAVAIL";
+    case 10050: return "WSAENETDOWN";
+    case 10051: return "WSAENETUNREACH";
+    case 10052: return "WSAENETRESET";
+    case 10053: return "WSAECONNABORTED";
+    case 10054: return "WSAECONNRESET";
+    case 10055: return "WSAENOBUFS";
+    case 10056: return "WSAEISCONN";
+    case 10057: return "WSAENOTCONN";
+    case 10058: return "WSAESHUTDOWN";
+    case 10060: return "WSAETIMEDOUT";
+    case 10061: return "WSAECONNREFUSED";
+    case 10064: return "WSAEHOSTDOWN";
+    case 10065: return "WSAEHOSTUNREACH";
+    case 10067: return "WSAEPROCLIM";
+    case 10091: return "WSASYSNOTREADY";
+    case 10092: return "WSAVERNOTSUPPORTED";
+    case 10093: return "WSANOTINITIALISED";
+    case 10101: return "WSAEDISCON";
+    case 10104: return "WSAEINVALIDPROCTABLE";
+    case 10105: return "WSAEINVALIDPROVIDER";
+    case 10106: return "WSAEPROVIDERFAILEDINIT";
+    case 10107: return "WSASYSCALLFAILURE";
+    case 11001: return "WSAHOST_NOT_FOUND";
+    case 11002: return "WSATRY_AGAIN";
+    case 11003: return "WSANO_RECOVERY";
+    case 11004: return "WSANO_DATA";
+    default: return "Undetermined error";
+  }
+}

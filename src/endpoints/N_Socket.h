@@ -1,0 +1,222 @@
+// A TCP or UDP endpoint that carries whole messages.
+//
+// Make one from an N_Address, a port and a SocketType (an outgoing socket), or
+// from a ConnectData that an N_Listener accepted. From then on call send() and
+// poll(); all network I/O happens on the runtime's network thread, so no call
+// here waits for the network. A constructed N_Initializer must outlive every
+// socket.
+//
+// Stream format on TCP ("package mechanism", on by default for TCP, off for
+// UDP): each message is a 4-byte little-endian length followed by that many
+// payload bytes; nothing else, no magic, no checksum. A length of 0 is a valid
+// empty message. A message of any size may be sent; it leaves in chunks of at
+// most getMaximumSendPacketSize() - 16 payload bytes, which leave no trace in
+// the stream. Without the mechanism one send() is one WSASend of exactly the
+// caller's bytes (one datagram on UDP) and one read is one message. Both ends
+// must agree on the mechanism; nothing in the bytes says which is in use.
+//
+// Threads and callbacks:
+//  - The three virtual operations are the way to hear of events on the
+//    network thread. receiveConnect() and receiveDisconnect() (when the
+//    network thread disconnects at FD_CLOSE or after a broken stream) run with
+//    the runtime's mutex held: they must not wait for a thread that needs it,
+//    and must not destroy their own socket. receive() runs with the mutex
+//    released; it may call send() and poll(), and it may destroy (or
+//    re-construct) its own socket, after which the network thread does not
+//    touch it again.
+//  - An exception thrown out of an override is dropped on the network thread
+//    and the event or message is kept, as if the override had returned true.
+//  - destruct() on another thread while receive() runs for this socket waits
+//    until receive() has returned, so a receive() override must not wait for
+//    a thread that is destroying its socket.
+//  - Flags read without a lock (isConnected, the event flag, the package flag,
+//    the reassembly counters) are atomics. On an event the order is always:
+//    the connected flag first, then the virtual operation, then the event
+//    flag, so pollConnect()/pollDisconnect() never report a half-made event.
+//  - pollConnect() and pollDisconnect() take the runtime's mutex for their
+//    walk. getFirstSocket()/getNextSocket() hand out registry slots and cannot
+//    be guarded across calls: don't construct or destroy sockets on another
+//    thread while walking with them.
+//
+// Receive-side robustness: whatever a peer sends is parsed within the
+// library's own blocks. A length prefix that can't be true (above 0x7FFFFFFB,
+// so that length + 4 overflows a 32-bit int, or with the top bit set) or a
+// message that can't be allocated breaks the stream: the rest of what arrives
+// on it is dropped, the half-collected message is freed, and the socket is
+// disconnected, which the application sees as a disconnect event. Other
+// connections are not affected. An allocation that fails when the network
+// thread posts a read disconnects the socket the same way.
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+
+#include "Q_DLList.h"
+#include "vardel_export.h"
+#include "vardel_platform.h"
+
+class N_Address;
+class N_Listener;
+class N_Initializer;
+// White-box access for the library's own tests and fuzz targets only.
+struct N_SocketTestAccess;
+
+class VARDEL_API N_Socket {
+ public:
+  enum SocketType : std::int32_t { SOCKET_TCP = 0, SOCKET_UDP = 1 };
+
+  // One record for data in flight in either direction: a send entry on the
+  // runtime's out-queue, a read entry on its in-queue, a finished message on
+  // a socket's receive queue, or an orphan whose socket died. Lists allocate
+  // it with its fields unset; each stage sets what it needs.
+  struct DataQueue {
+    char* pBuffer;                       // the owned allocation; null once handed on or freed
+    platform::WSABUF wsaBuf;             // length and first byte of the data (may lie inside pBuffer)
+    platform::WSAOVERLAPPED overlapped;  // hEvent points back at this record
+    bool bIssued;                        // handed to Winsock
+    bool bComplete;                      // message finished; on a send entry: its completion ran with an error
+    bool bConsumed;                      // poll() handed it out; the next poll() frees it
+    bool bLive;                          // the owning socket is alive
+    N_Socket* pSocket;                   // the owning socket; null for an orphan
+  };
+
+  // An accepted connection waiting for an owner (see N_Listener::pollConnect).
+  struct ConnectData {
+    N_Listener* pListener;
+    platform::SOCKET socket;
+    platform::sockaddr_in address;
+  };
+
+  N_Socket();
+  explicit N_Socket(ConnectData* data);
+  N_Socket(const N_Address* address, int port, SocketType type);
+  ~N_Socket();
+
+  N_Socket(const N_Socket&) = delete;
+  N_Socket& operator=(const N_Socket&) = delete;
+
+  // Takes over an accepted connection; `data` must come from an
+  // N_Listener::pollConnect and is freed on success (on failure it stays
+  // queued). The socket is connected from the start and never shows up in
+  // pollConnect(). getPort() is the peer's port.
+  void construct(ConnectData* data);
+  // An outgoing socket, bound to the local host's address. TCP connects in
+  // the background (pollConnect/receiveConnect tell when it's done); UDP binds
+  // the same port as the peer's, reads as connected at once and exchanges
+  // datagrams with that one peer only. Throws N_NetException_IPNotResolved*
+  // while the address has no identifier yet, N_NetException_LocalAddress-
+  // AlreadyInUse* if the local address is taken; the object is then
+  // unconstructed and may be constructed again.
+  void construct(const N_Address* address, int port, SocketType type);
+  // Closes the socket without a disconnect event. Queued sends that haven't
+  // left are dropped, unread messages are freed.
+  void destruct();
+
+  const N_Address* getAddress();
+  SocketType getSocketType();
+  int getPort();
+  // S: the limit of one WSASend. Without the package mechanism a send() of
+  // more than S bytes throws N_NetException_PacketTooBig*.
+  int getMaximumSendPacketSize() const;
+  bool isConnected();
+  void enablePackage();
+  void disablePackage();
+  // Ends the sending direction and reports a disconnect event (once, also if
+  // the peer's close comes later). Messages already received can still be
+  // polled.
+  void disconnect();
+  // Copies the message at once; the caller may reuse its buffer on return.
+  void send(void* data, unsigned int size);
+  // The next message, oldest first. It stays the socket's and is valid until
+  // the next poll() on this socket or its destruct(); every poll(), also one
+  // that returns false, frees the message the previous one handed out.
+  bool poll(void*& data, unsigned int& size);
+  // While a message spans reads: its size + 4, and the bytes still to come.
+  // 0 between messages and while only part of a length prefix is in.
+  int getReceivePacketSize() const;
+  int getReceivePacketBytesMissing() const;
+  // Bytes waiting to be sent by every socket of the process (4 more per
+  // packaged message), counted until their completion has run.
+  int getBytesWaitingForSend() const;
+
+  static N_Socket** getFirstSocket();
+  static N_Socket** getNextSocket(N_Socket** socket);
+  // Each call reports one socket with a pending connect (disconnect) event
+  // and clears it; loop until false.
+  static bool pollConnect(const N_Socket*& socket);
+  static bool pollDisconnect(const N_Socket*& socket);
+  static bool networkPresent();
+  // Not measured: always the largest float.
+  static float ping(N_Address* address);
+
+  // A connect completed. True keeps the event for pollConnect().
+  virtual bool receiveConnect();
+  // The connection ended. True keeps the event for pollDisconnect().
+  virtual bool receiveDisconnect();
+  // A whole message arrived. True keeps it for poll(); false frees it as soon
+  // as this returns.
+  virtual bool receive(void* data, unsigned int size);
+
+ private:
+  friend class N_Initializer;
+  friend class N_Listener;
+  friend struct N_SocketTestAccess;
+
+  bool isConstructed() const;
+  void initializeMembers();
+  void baseConstructor();
+  static int chkErr(int result);
+  static platform::SOCKET chkErr(platform::SOCKET result);
+  static const char* getWSErrorName(int code);
+  static void sendComplete(platform::DWORD dwError, platform::DWORD cbTransferred,
+                           platform::OVERLAPPED* lpOverlapped, platform::DWORD dwFlags);
+
+  static bool pollEvent(const N_Socket*& socket, bool connected);
+  // Send path: takes back the entries from `first` to the queue's tail.
+  static void dropSendEntriesFrom(DataQueue* first);
+
+  // Receive path, on the network thread with the runtime's mutex held. The
+  // bool results are false when the socket was destroyed during a receive()
+  // call; the caller must not touch it again then.
+  void postRead();
+  bool receivePlain(DataQueue* read, unsigned int bytes);
+  bool receivePackaged(DataQueue* read, unsigned int bytes);
+  bool finishInRead(DataQueue* read, char* payload, unsigned int size, bool last);
+  bool deliver(DataQueue* read, DataQueue* message);
+  DataQueue* appendMessage(char* buffer, char* data, unsigned int size);
+  void breakStream();
+  // In destruct(): waits, with the mutex given up meanwhile, until no
+  // receive() call of another thread runs for this socket.
+  void awaitDelivery();
+  // Feeds `size` bytes to the receive path as one completed read, the way
+  // the network thread does; for the tests' white-box access.
+  static void injectRead(N_Socket* socket, const void* bytes, unsigned int size);
+
+  bool m_bConstructed;
+  Q_DLList<DataQueue>* m_pReceiveQueue;
+  const N_Address* m_pAddress;
+  int m_iPort;
+  SocketType m_socketType;
+  platform::SOCKET m_socket;
+  platform::WSAEVENT m_event;
+  platform::sockaddr_in m_remoteAddress;
+  platform::sockaddr_in m_localAddress;
+  N_Socket** m_pRegistryEntry;
+  int m_iMaximumSendPacketSize;
+  std::atomic<bool> m_bConnected;
+  std::atomic<bool> m_bEventPending;
+  bool m_bOwnsAddress;
+  bool m_bWritable;
+  bool m_bWriteCompletionPending;
+  std::atomic<bool> m_bPackage;
+  std::atomic<int> m_iPacketBytesMissing;
+  std::atomic<int> m_iPacketBytesHave;
+  char* m_pPacketBuffer;
+  // A nonsense length or a failed allocation broke the package stream; the
+  // rest of its packaged reads is dropped.
+  bool m_bStreamBroken;
+  // The message entry whose receive() call runs now, with the mutex released;
+  // null otherwise. destruct() on another thread waits while it is set, and
+  // poll() leaves that entry in place.
+  DataQueue* m_pDelivering;
+};

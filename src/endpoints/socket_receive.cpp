@@ -1,0 +1,330 @@
+// The receive path: the network thread posts one read per FD_READ, and
+// receiveComplete() turns the bytes of each read into whole messages on the
+// socket's receive queue, undoing the length-prefixed stream format on a
+// packaged socket however the stream was cut into reads.
+//
+// Reassembly state between reads (m_iPacketBytesHave, m_iPacketBytesMissing,
+// m_pPacketBuffer):
+//   idle            0       0        null
+//   prefix partial  1..3    -1       1024 + first fragment bytes, the prefix so far
+//   body partial    4 + n   > 0      exactly length + 4 bytes, prefix and payload so far
+// A message that lies whole in a read and ends it is handed out in place, in
+// the read buffer; one with bytes behind it is copied out.
+#include <algorithm>
+#include <cstdint>
+#include <cstring>
+
+#include "N_Exceptions.h"
+#include "N_Initializer.h"
+#include "N_Socket.h"
+#include "Q_New.h"
+#include "Q_System.h"
+#include "win32.h"
+#include "winsock.h"
+
+using namespace platform;
+
+namespace {
+
+constexpr unsigned int kReadSize = 65536;
+// The largest length whose block (length + 4) still fits a 32-bit int.
+constexpr std::uint32_t kMaximumLength = 0x7FFFFFFB;
+constexpr int kPrefixSlack = 1024;
+
+// True on the network thread while it runs a receive() override.
+thread_local bool tl_bInReceive = false;
+
+std::uint32_t readLength(const char* at) {
+  const auto* b = reinterpret_cast<const unsigned char*>(at);
+  return std::uint32_t(b[0]) | std::uint32_t(b[1]) << 8 | std::uint32_t(b[2]) << 16 | std::uint32_t(b[3]) << 24;
+}
+
+}  // namespace
+
+void N_Socket::postRead() {
+  Q_DLList<DataQueue>* queue = N_Initializer::m_pInProcessQueue;
+  DataQueue* entry = nullptr;
+  try {
+    entry = queue->append();
+    entry->pBuffer = nullptr;
+    entry->bIssued = true;
+    entry->bConsumed = false;
+    entry->bLive = true;
+    entry->pSocket = this;
+    entry->wsaBuf.len = kReadSize;
+    entry->wsaBuf.buf = nullptr;
+    entry->pBuffer = Q_NewArray<char>(kReadSize);
+    entry->wsaBuf.buf = entry->pBuffer;
+  } catch (Q_MemoryException*) {
+    // Without a read posted no FD_READ would come again: the connection
+    // can't go on, so it ends as a disconnect the application sees.
+    if (entry != nullptr) queue->remove(entry);
+    try {
+      disconnect();
+    } catch (...) {
+    }
+    return;
+  }
+  std::memset(&entry->overlapped, 0, sizeof entry->overlapped);
+  entry->overlapped.hEvent = entry;
+  entry->bComplete = false;
+  DWORD received = 0;
+  DWORD flags = 0;
+  if (WSARecv(m_socket, &entry->wsaBuf, 1, &received, &flags, &entry->overlapped, N_Initializer::receiveComplete) ==
+      SOCKET_ERROR) {
+    int error = WSAGetLastError();
+    // WSAEWOULDBLOCK counts as under way, like WSA_IO_PENDING.
+    if (error != WSAEWOULDBLOCK && error != WSA_IO_PENDING) {
+      Q_DeleteArray(entry->pBuffer);
+      entry->pBuffer = nullptr;
+      entry->wsaBuf.buf = nullptr;
+      queue->remove(entry);
+    }
+  }
+}
+
+void N_Socket::breakStream() {
+  Q_DeleteArray(m_pPacketBuffer);
+  m_pPacketBuffer = nullptr;
+  m_iPacketBytesMissing = 0;
+  m_iPacketBytesHave = 0;
+  m_bStreamBroken = true;
+  try {
+    disconnect();
+  } catch (...) {
+  }
+}
+
+N_Socket::DataQueue* N_Socket::appendMessage(char* buffer, char* data, unsigned int size) {
+  DataQueue* message = m_pReceiveQueue->append();
+  message->pBuffer = buffer;
+  message->wsaBuf.len = size;
+  message->wsaBuf.buf = data;
+  std::memset(&message->overlapped, 0, sizeof message->overlapped);
+  message->bIssued = true;
+  message->bComplete = true;
+  message->bConsumed = false;
+  message->bLive = true;
+  message->pSocket = this;
+  return message;
+}
+
+bool N_Socket::deliver(DataQueue* read, DataQueue* message) {
+  m_pDelivering = message;
+  ReleaseMutex(N_Initializer::m_hMutex);
+  bool keep = true;
+  tl_bInReceive = true;
+  try {
+    keep = receive(message->wsaBuf.buf, message->wsaBuf.len);
+  } catch (...) {
+    keep = true;
+  }
+  tl_bInReceive = false;
+  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  // Only the override itself can have destroyed the socket meanwhile; then
+  // the socket, this message and maybe the read buffer are gone.
+  if (!read->bLive) return false;
+  m_pDelivering = nullptr;
+  // A message that poll() handed out meanwhile stays for the next poll().
+  if (!keep && !message->bConsumed) {
+    Q_DeleteArray(message->pBuffer);
+    m_pReceiveQueue->remove(message);
+  }
+  return true;
+}
+
+void N_Socket::awaitDelivery() {
+  while (m_pDelivering != nullptr && !tl_bInReceive) {
+    ReleaseMutex(N_Initializer::m_hMutex);
+    Sleep(1);
+    WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  }
+}
+
+bool N_Socket::receivePlain(DataQueue* read, unsigned int bytes) {
+  DataQueue* message;
+  try {
+    message = appendMessage(read->pBuffer, read->wsaBuf.buf, bytes);
+  } catch (Q_MemoryException*) {
+    breakStream();
+    return true;
+  }
+  read->pBuffer = nullptr;
+  read->wsaBuf.buf = nullptr;
+  return deliver(read, message);
+}
+
+bool N_Socket::finishInRead(DataQueue* read, char* payload, unsigned int size, bool last) {
+  DataQueue* message;
+  if (!last) {
+    char* copy = Q_NewArray<char>(size);
+    if (size > 0) std::memcpy(copy, payload, size);
+    try {
+      message = appendMessage(copy, copy, size);
+    } catch (...) {
+      Q_DeleteArray(copy);
+      throw;
+    }
+  } else {
+    message = appendMessage(read->pBuffer, payload, size);
+    read->pBuffer = nullptr;
+    read->wsaBuf.buf = nullptr;
+  }
+  return deliver(read, message);
+}
+
+bool N_Socket::receivePackaged(DataQueue* read, unsigned int bytes) {
+  if (m_bStreamBroken) return true;
+  // 64-bit arithmetic: a length near 2^31 must not wrap the comparisons.
+  std::int64_t left = bytes;
+  char* cursor = read->wsaBuf.buf;
+  try {
+    while (left > 0) {
+      std::int64_t have = m_iPacketBytesHave;
+      std::int64_t missing = m_iPacketBytesMissing;
+      if (have == 0) {
+        if (left < 4) {
+          // The prefix itself is cut.
+          Q_DeleteArray(m_pPacketBuffer);
+          m_pPacketBuffer = nullptr;
+          m_pPacketBuffer = Q_NewArray<char>(static_cast<std::size_t>(left + kPrefixSlack));
+          std::memcpy(m_pPacketBuffer, cursor, static_cast<std::size_t>(left));
+          m_iPacketBytesMissing = -1;
+          m_iPacketBytesHave = static_cast<int>(left);
+          return true;
+        }
+        std::uint32_t length = readLength(cursor);
+        if (length > kMaximumLength) {
+          breakStream();
+          return true;
+        }
+        if (left - length - 4 < 0) {
+          // The message spans reads: collect it at its final size.
+          Q_DeleteArray(m_pPacketBuffer);
+          m_pPacketBuffer = nullptr;
+          m_pPacketBuffer = Q_NewArray<char>(std::size_t(length) + 4);
+          std::memcpy(m_pPacketBuffer, cursor, static_cast<std::size_t>(left));
+          m_iPacketBytesMissing = static_cast<int>(length + 4 - left);
+          m_iPacketBytesHave = static_cast<int>(left);
+          return true;
+        }
+        char* payload = cursor + 4;
+        left -= 4 + std::int64_t(length);
+        cursor = payload + length;
+        if (!finishInRead(read, payload, length, left == 0)) return false;
+        continue;
+      }
+      if (missing < 0) {
+        // Complete the prefix, then collect the body in a block of its size.
+        std::int64_t n = 4 - have;
+        if (left < n) {
+          std::memcpy(m_pPacketBuffer + have, cursor, static_cast<std::size_t>(left));
+          m_iPacketBytesHave = static_cast<int>(have + left);
+          return true;
+        }
+        std::memcpy(m_pPacketBuffer + have, cursor, static_cast<std::size_t>(n));
+        cursor += n;
+        left -= n;
+        std::uint32_t length = readLength(m_pPacketBuffer);
+        if (length > kMaximumLength) {
+          breakStream();
+          return true;
+        }
+        char* block = Q_NewArray<char>(std::size_t(length) + 4);
+        std::memcpy(block, m_pPacketBuffer, 4);
+        Q_DeleteArray(m_pPacketBuffer);
+        m_pPacketBuffer = block;
+        have = 4;
+        missing = length;
+        m_iPacketBytesHave = 4;
+        m_iPacketBytesMissing = static_cast<int>(length);
+      }
+      if (missing > left) {
+        if (left > 0) std::memcpy(m_pPacketBuffer + have, cursor, static_cast<std::size_t>(left));
+        m_iPacketBytesMissing = static_cast<int>(missing - left);
+        m_iPacketBytesHave = static_cast<int>(have + left);
+        return true;
+      }
+      if (missing > 0) std::memcpy(m_pPacketBuffer + have, cursor, static_cast<std::size_t>(missing));
+      have += missing;
+      cursor += missing;
+      left -= missing;
+      DataQueue* message = appendMessage(m_pPacketBuffer, m_pPacketBuffer + 4, static_cast<unsigned int>(have - 4));
+      m_pPacketBuffer = nullptr;
+      m_iPacketBytesMissing = 0;
+      m_iPacketBytesHave = 0;
+      if (!deliver(read, message)) return false;
+    }
+  } catch (Q_MemoryException*) {
+    // What can't be held can't be skipped either: the stream has lost its
+    // place, so the connection ends.
+    breakStream();
+  }
+  return true;
+}
+
+void N_Initializer::receiveComplete(DWORD error, DWORD bytes, OVERLAPPED* overlapped, DWORD flags) {
+  auto* read = static_cast<N_Socket::DataQueue*>(overlapped->hEvent);
+  if (error != 0) {
+    const char* text = Q_STR(
+        "receiveComplete: dwError = %s (%d),\n                 lpOverlapped->hEvent = 0x%08X\n"
+        "                 cbTransferred = %d\n                 dwFlags = %d\n",
+        N_Socket::getWSErrorName(static_cast<int>(error)), static_cast<int>(error),
+        static_cast<unsigned int>(reinterpret_cast<std::uintptr_t>(overlapped->hEvent)), static_cast<int>(bytes),
+        static_cast<int>(flags));
+    Sys->verbose("%s", text);
+    // The reassembly state stays as it is; the read itself is over, and
+    // nothing names its entry any more, so it goes now rather than at the
+    // runtime's stop (a peer that resets connections again and again must
+    // not make the queue grow).
+    WaitForSingleObject(m_hMutex, INFINITE);
+    Q_DeleteArray(read->pBuffer);
+    read->pBuffer = nullptr;
+    read->wsaBuf.buf = nullptr;
+    m_pInProcessQueue->remove(read);
+    ReleaseMutex(m_hMutex);
+    return;
+  }
+  WaitForSingleObject(m_hMutex, INFINITE);
+  N_Socket* socket = read->pSocket;
+  if (read->bLive && socket != nullptr) {
+    unsigned int size = std::min<unsigned int>(bytes, read->wsaBuf.len);
+    if (socket->m_bPackage)
+      socket->receivePackaged(read, size);
+    else
+      socket->receivePlain(read, size);
+  }
+  Q_DeleteArray(read->pBuffer);
+  read->pBuffer = nullptr;
+  read->wsaBuf.buf = nullptr;
+  m_pInProcessQueue->remove(read);
+  ReleaseMutex(m_hMutex);
+}
+
+void N_Socket::injectRead(N_Socket* socket, const void* bytes, unsigned int size) {
+  size = std::min(size, kReadSize);
+  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  Q_DLList<DataQueue>* queue = N_Initializer::m_pInProcessQueue;
+  DataQueue* entry = nullptr;
+  try {
+    entry = queue->append();
+    entry->pBuffer = nullptr;
+    entry->pBuffer = Q_NewArray<char>(kReadSize);
+  } catch (...) {
+    if (entry != nullptr) queue->remove(entry);
+    ReleaseMutex(N_Initializer::m_hMutex);
+    throw;
+  }
+  entry->wsaBuf.len = kReadSize;
+  entry->wsaBuf.buf = entry->pBuffer;
+  std::memset(&entry->overlapped, 0, sizeof entry->overlapped);
+  entry->overlapped.hEvent = entry;
+  entry->bIssued = true;
+  entry->bComplete = false;
+  entry->bConsumed = false;
+  entry->bLive = true;
+  entry->pSocket = socket;
+  if (size > 0) std::memcpy(entry->pBuffer, bytes, size);
+  ReleaseMutex(N_Initializer::m_hMutex);
+  N_Initializer::receiveComplete(0, size, &entry->overlapped, 0);
+}

@@ -1,0 +1,131 @@
+// The send path: send() turns a message into send entries on the runtime's
+// out-queue (length prefix and chunks on a packaged socket), the network
+// thread's pump issues them, and sendComplete() ends them.
+#include <cstdint>
+#include <cstring>
+
+#include "N_Initializer.h"
+#include "N_Socket.h"
+#include "Q_New.h"
+#include "Q_System.h"
+#include "Q_Throw.h"
+#include "win32.h"
+#include "winsock.h"
+
+using namespace platform;
+
+namespace {
+
+// A chunk keeps 16 bytes below the send limit, also the first one that
+// carries the prefix, so no single WSASend exceeds the socket's buffer.
+constexpr unsigned int kChunkReserve = 16;
+
+void prepare(N_Socket::DataQueue* entry, N_Socket* socket) {
+  entry->pBuffer = nullptr;
+  entry->wsaBuf.len = 0;
+  entry->wsaBuf.buf = nullptr;
+  std::memset(&entry->overlapped, 0, sizeof entry->overlapped);
+  entry->bIssued = false;
+  entry->bComplete = false;
+  entry->bConsumed = false;
+  entry->bLive = true;
+  entry->pSocket = socket;
+}
+
+void writeLength(char* to, std::uint32_t length) {
+  to[0] = static_cast<char>(length & 0xFF);
+  to[1] = static_cast<char>((length >> 8) & 0xFF);
+  to[2] = static_cast<char>((length >> 16) & 0xFF);
+  to[3] = static_cast<char>((length >> 24) & 0xFF);
+}
+
+}  // namespace
+
+void N_Socket::dropSendEntriesFrom(DataQueue* first) {
+  Q_DLList<DataQueue>* queue = N_Initializer::m_pOutProcessQueue;
+  while (first != nullptr) {
+    DataQueue* next = queue->getNext(first);
+    Q_DeleteArray(first->pBuffer);
+    queue->remove(first);
+    first = next;
+  }
+}
+
+void N_Socket::send(void* data, unsigned int size) {
+  const char* bytes = static_cast<const char*>(data);
+  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  Q_DLList<DataQueue>* queue = N_Initializer::m_pOutProcessQueue;
+  DataQueue* first = nullptr;
+  try {
+    unsigned int limit = static_cast<unsigned int>(m_iMaximumSendPacketSize > 0 ? m_iMaximumSendPacketSize : 0);
+    if (!m_bPackage) {
+      if (size > limit) Q_ThrowPacketTooBig(static_cast<int>(size), m_iMaximumSendPacketSize);
+      first = queue->append();
+      prepare(first, this);
+      first->pBuffer = Q_NewArray<char>(size);
+      first->wsaBuf.buf = first->pBuffer;
+      first->wsaBuf.len = size;
+      if (size > 0) std::memcpy(first->pBuffer, bytes, size);
+    } else {
+      unsigned int chunkLimit = limit > kChunkReserve ? limit - kChunkReserve : 1;
+      unsigned int chunk = size < chunkLimit ? size : chunkLimit;
+      first = queue->append();
+      prepare(first, this);
+      first->pBuffer = Q_NewArray<char>(static_cast<std::size_t>(chunk) + 4);
+      first->wsaBuf.buf = first->pBuffer;
+      first->wsaBuf.len = chunk + 4;
+      // The whole message's size, however many chunks follow.
+      writeLength(first->pBuffer, size);
+      if (chunk > 0) std::memcpy(first->pBuffer + 4, bytes, chunk);
+      unsigned int left = size - chunk;
+      unsigned int offset = chunk;
+      while (left > 0) {
+        unsigned int c = left < chunkLimit ? left : chunkLimit;
+        DataQueue* entry = queue->append();
+        prepare(entry, this);
+        entry->pBuffer = Q_NewArray<char>(c);
+        entry->wsaBuf.buf = entry->pBuffer;
+        entry->wsaBuf.len = c;
+        std::memcpy(entry->pBuffer, bytes + offset, c);
+        left -= c;
+        offset += c;
+      }
+    }
+  } catch (...) {
+    // Nothing of a message that failed stays queued.
+    dropSendEntriesFrom(first);
+    ReleaseMutex(N_Initializer::m_hMutex);
+    throw;
+  }
+  N_Initializer::releaseThreadLoop();
+  ReleaseMutex(N_Initializer::m_hMutex);
+}
+
+void N_Socket::sendComplete(DWORD dwError, DWORD cbTransferred, OVERLAPPED* lpOverlapped, DWORD dwFlags) {
+  DataQueue* entry = static_cast<DataQueue*>(lpOverlapped->hEvent);
+  if (dwError != 0) {
+    const char* text = Q_STR(
+        "sendComplete: dwError = %s (%d),\n              lpOverlapped->hEvent = 0x%08X\n"
+        "              cbTransferred = %d\n              dwFlags = %d\n",
+        getWSErrorName(static_cast<int>(dwError)), static_cast<int>(dwError),
+        static_cast<unsigned int>(reinterpret_cast<std::uintptr_t>(lpOverlapped->hEvent)),
+        static_cast<int>(cbTransferred), static_cast<int>(dwFlags));
+    Sys->verbose("%s", text);
+    // The entry stays queued and isn't sent again. Marking it lets the pump
+    // free it once its socket has died; this runs on the network thread, as
+    // the pump does, so nothing else sees the flag change.
+    entry->bComplete = true;
+    return;
+  }
+  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  Q_DeleteArray(entry->pBuffer);
+  entry->pBuffer = nullptr;
+  entry->wsaBuf.buf = nullptr;
+  N_Socket* socket = entry->pSocket;
+  if (socket != nullptr && !socket->m_bWritable && socket->m_bWriteCompletionPending) {
+    socket->m_bWritable = true;
+    socket->m_bWriteCompletionPending = false;
+  }
+  N_Initializer::m_pOutProcessQueue->remove(entry);
+  ReleaseMutex(N_Initializer::m_hMutex);
+}

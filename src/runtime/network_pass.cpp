@@ -1,0 +1,144 @@
+// The parts of the network thread's pass that deal with sockets and
+// listeners: the wait set, the send pump and the service of one signalled
+// event. All of it runs on the network thread with m_hMutex held.
+#include <cstring>
+
+#include "N_Exceptions.h"
+#include "N_Initializer.h"
+#include "N_Listener.h"
+#include "N_Socket.h"
+#include "Q_New.h"
+#include "win32.h"
+#include "winsock.h"
+
+using namespace platform;
+
+DWORD N_Initializer::buildWaitSet(WSAEVENT* events) {
+  DWORD count = 0;
+  events[count++] = m_eventRelease;
+  // Sockets first: with 63 sockets or more no listener is waited on. The
+  // lists keep their order, so the same objects stay out until others go.
+  for (N_Socket** slot = m_pSockets->getFirst(); slot != nullptr && count < WSA_MAXIMUM_WAIT_EVENTS;
+       slot = m_pSockets->getNext(slot))
+    if (*slot != nullptr) events[count++] = (*slot)->m_event;
+  for (N_Listener** slot = m_pListeners->getFirst(); slot != nullptr && count < WSA_MAXIMUM_WAIT_EVENTS;
+       slot = m_pListeners->getNext(slot))
+    if (*slot != nullptr) events[count++] = (*slot)->m_event;
+  return count;
+}
+
+void N_Initializer::pumpSends() {
+  Q_DLList<N_Socket::DataQueue>* queue = m_pOutProcessQueue;
+  N_Socket::DataQueue* entry = queue->getFirst();
+  while (entry != nullptr) {
+    N_Socket::DataQueue* next = queue->getNext(entry);
+    N_Socket* socket = entry->pSocket;
+    if (socket == nullptr) {
+      // An orphan. One whose WSASend is still out stays until its
+      // completion: Winsock names its overlapped until then. One whose
+      // completion failed is marked complete and can go.
+      if (!entry->bIssued || entry->bComplete) {
+        Q_DeleteArray(entry->pBuffer);
+        entry->pBuffer = nullptr;
+        entry->wsaBuf.buf = nullptr;
+        queue->remove(entry);
+      }
+    } else if (!entry->bIssued && socket->m_bWritable) {
+      entry->overlapped.hEvent = entry;
+      DWORD sent = 0;
+      if (WSASend(socket->m_socket, &entry->wsaBuf, 1, &sent, 0, &entry->overlapped, N_Socket::sendComplete) == 0) {
+        entry->bIssued = true;
+      } else {
+        int error = WSAGetLastError();
+        if (error == WSAEWOULDBLOCK) {
+          // This and every later entry of the socket wait for FD_WRITE.
+          socket->m_bWritable = false;
+          entry->overlapped.hEvent = nullptr;
+        } else if (error == WSA_IO_PENDING) {
+          // Later entries wait for this one's completion.
+          entry->bIssued = true;
+          socket->m_bWritable = false;
+          socket->m_bWriteCompletionPending = true;
+        }
+        // Any other failure: tried again on a later pass.
+      }
+    }
+    entry = next;
+  }
+}
+
+void N_Initializer::serveEvent(WSAEVENT handle) {
+  // Found by handle, not by slot: the lists may have changed in the wait.
+  N_Socket* socket = nullptr;
+  for (N_Socket** slot = m_pSockets->getFirst(); slot != nullptr; slot = m_pSockets->getNext(slot)) {
+    if (*slot != nullptr && (*slot)->m_event == handle) {
+      socket = *slot;
+      break;
+    }
+  }
+  N_Listener* listener = nullptr;
+  for (N_Listener** slot = m_pListeners->getFirst(); slot != nullptr; slot = m_pListeners->getNext(slot)) {
+    if (*slot != nullptr && (*slot)->m_event == handle) {
+      listener = *slot;
+      break;
+    }
+  }
+
+  if (socket != nullptr) {
+    // Zeroed first: a failed enumeration must not serve an old record again.
+    WSANETWORKEVENTS events;
+    std::memset(&events, 0, sizeof events);
+    N_Socket::chkErr(WSAEnumNetworkEvents(socket->m_socket, socket->m_event, &events));
+    long what = events.lNetworkEvents;
+    if ((what & FD_CONNECT) && events.iErrorCode[FD_CONNECT_BIT] == 0 && !socket->m_bConnected) {
+      socket->m_bConnected = true;
+      bool keep = true;
+      try {
+        keep = socket->receiveConnect();
+      } catch (...) {
+      }
+      if (keep) socket->m_bEventPending = true;
+    }
+    if (what & FD_READ) socket->postRead();
+    if (what & FD_WRITE) socket->m_bWritable = true;
+    if (what & FD_CLOSE) {
+      try {
+        socket->disconnect();
+      } catch (...) {
+      }
+    }
+  }
+
+  if (listener != nullptr) {
+    WSANETWORKEVENTS events;
+    std::memset(&events, 0, sizeof events);
+    N_Socket::chkErr(WSAEnumNetworkEvents(listener->m_socket, listener->m_event, &events));
+    if (!(events.lNetworkEvents & FD_ACCEPT)) return;
+    WSASetLastError(0);
+    N_Socket::ConnectData* entry = nullptr;
+    try {
+      entry = m_pConnectQueue->append();
+    } catch (Q_MemoryException*) {
+      // No room to keep the connection: accept it and close it, so that it
+      // is refused rather than left waiting.
+      sockaddr_in address;
+      int length = sizeof address;
+      SOCKET refused = WSAAccept(listener->m_socket, reinterpret_cast<sockaddr*>(&address), &length, nullptr, 0);
+      if (refused != INVALID_SOCKET) closesocket(refused);
+      return;
+    }
+    entry->pListener = listener;
+    std::memset(&entry->address, 0, sizeof entry->address);
+    int length = sizeof entry->address;
+    entry->socket = N_Socket::chkErr(
+        WSAAccept(listener->m_socket, reinterpret_cast<sockaddr*>(&entry->address), &length, nullptr, 0));
+    if (WSAGetLastError() == WSAECONNREFUSED) {
+      m_pConnectQueue->remove(entry);
+      return;
+    }
+    try {
+      listener->receiveConnect(entry);
+    } catch (...) {
+    }
+  }
+}
