@@ -1,0 +1,288 @@
+#include "N_Initializer.h"
+
+#include "N_Address.h"
+#include "N_Listener.h"
+#include "N_Socket.h"
+#include "Q_New.h"
+#include "Q_Throw.h"
+#include "Q_Timer.h"
+#include "win32.h"
+#include "winsock.h"
+
+using namespace platform;
+
+namespace {
+
+const char kNetworkMutexName[] = "Kelvane network mutex";
+constexpr WORD kWinsockVersion = 0x0002;  // 2.0
+constexpr DWORD kMaximumWaitEvents = 64;
+// How long the start waits for the local host's identifier.
+constexpr float kLocalAddressSeconds = 10.0f;
+
+constexpr DWORD kTcpFlags =
+    XP1_GUARANTEED_DELIVERY | XP1_GUARANTEED_ORDER | XP1_GRACEFUL_CLOSE | XP1_EXPEDITED_DATA | XP1_IFS_HANDLES;
+constexpr DWORD kUdpFlags =
+    XP1_CONNECTIONLESS | XP1_MESSAGE_ORIENTED | XP1_SUPPORT_BROADCAST | XP1_SUPPORT_MULTIPOINT | XP1_IFS_HANDLES;
+
+// Deletes every object a registry still names, oldest first, then whatever
+// entries are left, then the list. Each object's destructor takes its own
+// entry out, so the next entry is taken before the object goes.
+template <class T>
+void deleteRegistered(Q_DLList<T*>*& list) {
+  if (list == nullptr) return;
+  for (T** entry = list->getFirst(); entry != nullptr;) {
+    T** next = list->getNext(entry);
+    if (*entry != nullptr) Q_Delete(*entry);
+    entry = next;
+  }
+  while (T** entry = list->getFirst()) list->remove(entry);
+  Q_Delete(list);
+  list = nullptr;
+}
+
+// Frees the buffers the records of a queue still own, then the queue.
+void deleteQueue(Q_DLList<N_Socket::DataQueue>*& queue) {
+  if (queue == nullptr) return;
+  for (N_Socket::DataQueue* entry = queue->getFirst(); entry != nullptr; entry = queue->getNext(entry)) {
+    if (entry->pBuffer != nullptr) {
+      Q_DeleteArray(static_cast<char*>(entry->pBuffer));
+      entry->pBuffer = nullptr;
+      entry->wsaBuf.buf = nullptr;
+    }
+  }
+  Q_Delete(queue);
+  queue = nullptr;
+}
+
+}  // namespace
+
+std::uint32_t N_Initializer::m_uInstance = 0;
+N_Initializer* N_Initializer::m_pActiveObject = nullptr;
+std::atomic<N_Initializer::ThreadState> N_Initializer::m_threadState{THREAD_STOPPED};
+CWinThread* N_Initializer::m_pThread = nullptr;
+bool N_Initializer::m_bThreadStartFailed = false;
+int N_Initializer::m_iNumProtocols = 0;
+WSAPROTOCOL_INFOA* N_Initializer::m_installedProtocols = nullptr;
+WSAPROTOCOL_INFOA* N_Initializer::m_tcpProtocol = nullptr;
+WSAPROTOCOL_INFOA* N_Initializer::m_udpProtocol = nullptr;
+HANDLE N_Initializer::m_hMutex = nullptr;
+WSAEVENT N_Initializer::m_eventRelease = nullptr;
+N_Address* N_Initializer::m_pLocalAddress = nullptr;
+Q_DLList<N_Socket*>* N_Initializer::m_pSockets = nullptr;
+Q_DLList<N_Listener*>* N_Initializer::m_pListeners = nullptr;
+Q_DLList<N_Address*>* N_Initializer::m_pAddresses = nullptr;
+Q_DLList<N_Socket::ConnectData>* N_Initializer::m_pConnectQueue = nullptr;
+Q_DLList<N_Socket::DataQueue>* N_Initializer::m_pInProcessQueue = nullptr;
+Q_DLList<N_Socket::DataQueue>* N_Initializer::m_pOutProcessQueue = nullptr;
+
+N_Initializer::N_Initializer() : m_wsaData{} {
+  if (m_uInstance++ != 0) return;
+  start();
+}
+
+N_Initializer::~N_Initializer() {
+  if (m_uInstance == 0) return;
+  if (--m_uInstance != 0) return;
+  stop();
+}
+
+N_Initializer& N_Initializer::operator=(const N_Initializer& other) {
+  m_wsaData = other.m_wsaData;
+  return *this;
+}
+
+// Nothing done here is undone when a step throws: the count stays raised and
+// later instances are no-ops (see the header).
+void N_Initializer::start() {
+  m_pThread = nullptr;
+  m_bThreadStartFailed = false;
+  m_pActiveObject = this;
+
+  m_pSockets = Q_New<Q_DLList<N_Socket*>>();
+  m_pListeners = Q_New<Q_DLList<N_Listener*>>();
+  m_pAddresses = Q_New<Q_DLList<N_Address*>>();
+  m_pConnectQueue = Q_New<Q_DLList<N_Socket::ConnectData>>();
+  m_pInProcessQueue = Q_New<Q_DLList<N_Socket::DataQueue>>();
+  m_pOutProcessQueue = Q_New<Q_DLList<N_Socket::DataQueue>>();
+
+  m_hMutex = CreateMutexA(nullptr, FALSE, kNetworkMutexName);
+
+  int started = WSAStartup(kWinsockVersion, &m_wsaData);
+  switch (started) {
+    case WSASYSNOTREADY:
+      Q_Throw<N_NetException_Unavailable>();
+    case WSAVERNOTSUPPORTED:
+      Q_Throw<N_NetException_NotSupported>();
+    case WSAEPROCLIM:
+      Q_Throw<N_NetException_ProcessLimit>();
+    default:
+      break;
+  }
+  // 2.0 exactly: a newer Winsock answers a request for 2.0 with 2.0. After
+  // any other failed start m_wsaData is still zero and fails this test too,
+  // but there is nothing to clean up then.
+  BYTE major = static_cast<BYTE>(m_wsaData.wVersion & 0xFF);
+  BYTE minor = static_cast<BYTE>(m_wsaData.wVersion >> 8);
+  if (major != 2 || minor != 0) {
+    if (started == 0) WSACleanup();
+    Q_Throw<N_NetException_VersionFailure>();
+  }
+
+  // The first call only tells the size of the catalogue.
+  DWORD bytes = 0;
+  m_iNumProtocols = WSAEnumProtocolsA(nullptr, nullptr, &bytes);
+  m_installedProtocols = reinterpret_cast<WSAPROTOCOL_INFOA*>(Q_NewArray<char>(bytes));
+  m_iNumProtocols = WSAEnumProtocolsA(nullptr, m_installedProtocols, &bytes);
+  // Never trust a count beyond the buffer it describes.
+  int fits = static_cast<int>(bytes / sizeof(WSAPROTOCOL_INFOA));
+  if (m_iNumProtocols > fits) m_iNumProtocols = fits;
+
+  chooseProviders();
+  if (m_tcpProtocol == nullptr) Q_Throw<N_NetException_NoTCP>();
+  if (m_udpProtocol == nullptr) Q_Throw<N_NetException_NoUDP>();
+
+  m_eventRelease = WSACreateEvent();
+
+  // The thread writes THREAD_RUNNING once, without looking; waiting for that
+  // write here means no stop can be overwritten by it.
+  m_pThread = AfxBeginThread(threadNetwork, this, 0, 0, 0, nullptr);
+  if (m_pThread == nullptr) {
+    m_bThreadStartFailed = true;
+  } else {
+    while (m_threadState.load() != THREAD_RUNNING) Sleep(1);
+  }
+
+  makeLocalAddress();
+}
+
+// The first entry that has every required bit wins, for each kind on its
+// own; the walk always covers the whole catalogue.
+void N_Initializer::chooseProviders() {
+  m_udpProtocol = nullptr;
+  m_tcpProtocol = nullptr;
+  for (int i = 0; i < m_iNumProtocols; ++i) {
+    WSAPROTOCOL_INFOA* entry = &m_installedProtocols[i];
+    if (entry->iAddressFamily != AF_INET) continue;
+    if (m_tcpProtocol == nullptr && (entry->dwServiceFlags1 & kTcpFlags) == kTcpFlags) m_tcpProtocol = entry;
+    if (m_udpProtocol == nullptr && (entry->dwServiceFlags1 & kUdpFlags) == kUdpFlags) m_udpProtocol = entry;
+  }
+}
+
+// Waits, bounded, for the local host's identifier. A lookup that has ended
+// without one won't bring it later, so the wait ends with it.
+void N_Initializer::makeLocalAddress() {
+  // Qualified: the C library's gethostname may be visible through standard
+  // headers, and would win for a size_t length.
+  char name[1024] = {};
+  platform::gethostname(name, static_cast<int>(sizeof name));
+  m_pLocalAddress = Q_New<N_Address>(name);
+
+  Q_Timer timer;
+  while (m_pLocalAddress->getIdentifier() == 0 && m_pLocalAddress->lookupPending() &&
+         timer.getAge() < kLocalAddressSeconds) {
+    Sleep(10);
+  }
+  if (m_pLocalAddress->getIdentifier() == 0) Q_Throw<N_NetException_IPNotResolved>();
+}
+
+void N_Initializer::stop() {
+  // Frees the network thread if this thread still owns the mutex by a level.
+  ReleaseMutex(m_hMutex);
+
+  if (!m_bThreadStartFailed) {
+    m_threadState.store(THREAD_STOPPING);
+    releaseThreadLoop();
+    while (m_threadState.load() != THREAD_STOPPED) Sleep(10);
+    // The thread writes THREAD_STOPPED just before its last release of the
+    // mutex; taking it once makes sure that release is done before anything
+    // below closes the mutex.
+    WaitForSingleObject(m_hMutex, INFINITE);
+    ReleaseMutex(m_hMutex);
+  }
+
+  Q_DeleteArray(reinterpret_cast<char*>(m_installedProtocols));
+  m_installedProtocols = nullptr;
+  m_tcpProtocol = nullptr;
+  m_udpProtocol = nullptr;
+
+  // Its destructor takes it out of m_pAddresses.
+  Q_Delete(m_pLocalAddress);
+  m_pLocalAddress = nullptr;
+
+  deleteRegistered(m_pSockets);
+  deleteRegistered(m_pListeners);
+  deleteRegistered(m_pAddresses);
+
+  // Connections nobody claimed go with their records; their sockets are
+  // closed by WSACleanup below.
+  Q_Delete(m_pConnectQueue);
+  m_pConnectQueue = nullptr;
+  deleteQueue(m_pInProcessQueue);
+  deleteQueue(m_pOutProcessQueue);
+
+  WSACloseEvent(m_eventRelease);
+  CloseHandle(m_hMutex);
+  m_hMutex = nullptr;
+  WSACleanup();
+}
+
+void N_Initializer::releaseThreadLoop() { WSASetEvent(m_eventRelease); }
+
+int N_Initializer::acceptConnection(WSABUF*, WSABUF*, _QualityOfService*, _QualityOfService*, WSABUF*, WSABUF*,
+                                    UINT*, std::uintptr_t) {
+  return CF_ACCEPT;
+}
+
+unsigned int N_Initializer::threadNetwork(void*) {
+  // The stop clears m_hMutex after this thread has ended; its last release
+  // uses this copy.
+  HANDLE mutex = m_hMutex;
+  WaitForSingleObject(mutex, INFINITE);
+  m_threadState.store(THREAD_RUNNING);
+
+  WSAEVENT events[kMaximumWaitEvents];
+  int failedWaits = 0;
+  while (m_threadState.load() == THREAD_RUNNING) {
+    DWORD count = 1;
+    events[0] = m_eventRelease;
+    try {
+      count = buildWaitSet(events);
+      pumpSends();
+    } catch (...) {
+      // Nothing may leave this thread; what failed is tried on the next pass.
+    }
+    ReleaseMutex(mutex);
+
+    // Completion routines run inside this wait and take the mutex themselves.
+    DWORD result = WSAWaitForMultipleEvents(count, events, FALSE, WSA_INFINITE, TRUE);
+    if (m_threadState.load() != THREAD_RUNNING) break;
+
+    // A wait that keeps failing (a broken release event, say) must not turn
+    // into a busy loop; a single failure, from a handle closed just before
+    // the wait, costs nothing.
+    if (result == WSA_WAIT_FAILED) {
+      if (++failedWaits > 1) Sleep(10);
+    } else {
+      failedWaits = 0;
+    }
+
+    WaitForSingleObject(mutex, INFINITE);
+    if (result == WSA_WAIT_EVENT_0) {
+      WSAResetEvent(events[0]);
+    } else if (result == WSA_WAIT_FAILED || result == WSA_WAIT_IO_COMPLETION || result == WSA_WAIT_TIMEOUT) {
+      // Nothing to serve; the next pass builds the wait set anew.
+    } else if (result < count) {
+      try {
+        serveEvent(events[result]);
+      } catch (...) {
+        // An allocation that failed while serving costs that event only.
+      }
+    }
+  }
+
+  m_threadState.store(THREAD_STOPPED);
+  // Fails harmlessly when the loop was left right after the wait, without
+  // the mutex.
+  ReleaseMutex(mutex);
+  return 0;
+}
