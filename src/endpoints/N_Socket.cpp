@@ -64,6 +64,7 @@ void N_Socket::initializeMembers() {
   m_pPacketBuffer = nullptr;
   m_bStreamBroken = false;
   m_pDelivering = nullptr;
+  m_uPumpHeldPass = 0;
 }
 
 void N_Socket::baseConstructor() {

@@ -188,9 +188,9 @@ class VARDEL_API N_Socket {
   // In destruct(): waits, with the mutex given up meanwhile, until no
   // receive() call of another thread runs for this socket.
   void awaitDelivery();
-  // Feeds `size` bytes to the receive path as one completed read, the way
-  // the network thread does; for the tests' white-box access.
-  static void injectRead(N_Socket* socket, const void* bytes, unsigned int size);
+  // Feeds `size` bytes to the receive path as one read that completed with
+  // `error`, the way the network thread does; for the tests' white-box access.
+  static void injectRead(N_Socket* socket, const void* bytes, unsigned int size, platform::DWORD error = 0);
 
   bool m_bConstructed;
   Q_DLList<DataQueue>* m_pReceiveQueue;
@@ -219,4 +219,8 @@ class VARDEL_API N_Socket {
   // null otherwise. destruct() on another thread waits while it is set, and
   // poll() leaves that entry in place.
   DataQueue* m_pDelivering;
+  // The send pump's pass in which a WSASend of this socket failed for a
+  // reason it retries later; the socket's later entries wait for that retry,
+  // so that the stream keeps its order.
+  unsigned int m_uPumpHeldPass;
 };

@@ -301,7 +301,7 @@ void N_Initializer::receiveComplete(DWORD error, DWORD bytes, OVERLAPPED* overla
   ReleaseMutex(m_hMutex);
 }
 
-void N_Socket::injectRead(N_Socket* socket, const void* bytes, unsigned int size) {
+void N_Socket::injectRead(N_Socket* socket, const void* bytes, unsigned int size, DWORD error) {
   size = std::min(size, kReadSize);
   WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
   Q_DLList<DataQueue>* queue = N_Initializer::m_pInProcessQueue;
@@ -326,5 +326,5 @@ void N_Socket::injectRead(N_Socket* socket, const void* bytes, unsigned int size
   entry->pSocket = socket;
   if (size > 0) std::memcpy(entry->pBuffer, bytes, size);
   ReleaseMutex(N_Initializer::m_hMutex);
-  N_Initializer::receiveComplete(0, size, &entry->overlapped, 0);
+  N_Initializer::receiveComplete(error, error == 0 ? size : 0, &entry->overlapped, 0);
 }

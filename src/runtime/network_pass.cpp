@@ -28,6 +28,10 @@ DWORD N_Initializer::buildWaitSet(WSAEVENT* events) {
 }
 
 void N_Initializer::pumpSends() {
+  // Numbers the passes so that a socket can be held for the rest of one
+  // without a walk to clear the marks (0 is never a pass number).
+  static unsigned int pass = 0;
+  if (++pass == 0) pass = 1;
   Q_DLList<N_Socket::DataQueue>* queue = m_pOutProcessQueue;
   N_Socket::DataQueue* entry = queue->getFirst();
   while (entry != nullptr) {
@@ -43,7 +47,7 @@ void N_Initializer::pumpSends() {
         entry->wsaBuf.buf = nullptr;
         queue->remove(entry);
       }
-    } else if (!entry->bIssued && socket->m_bWritable) {
+    } else if (!entry->bIssued && socket->m_bWritable && socket->m_uPumpHeldPass != pass) {
       entry->overlapped.hEvent = entry;
       DWORD sent = 0;
       if (WSASend(socket->m_socket, &entry->wsaBuf, 1, &sent, 0, &entry->overlapped, N_Socket::sendComplete) == 0) {
@@ -59,8 +63,11 @@ void N_Initializer::pumpSends() {
           entry->bIssued = true;
           socket->m_bWritable = false;
           socket->m_bWriteCompletionPending = true;
+        } else {
+          // Tried again on a later pass. The socket's later entries must not
+          // overtake it, so they wait too.
+          socket->m_uPumpHeldPass = pass;
         }
-        // Any other failure: tried again on a later pass.
       }
     }
     entry = next;

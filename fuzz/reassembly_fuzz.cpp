@@ -1,0 +1,163 @@
+// Fuzzes the receive path of a packaged socket: the input is a stream of
+// bytes and the points at which it is cut into reads; each read is handed to
+// the receive path the way the network thread hands a completed WSARecv.
+//
+// Input layout: byte 0 = k (taken modulo 16), then k little-endian 16-bit
+// read sizes (each 1 to 65536, used in turn, again and again), then the
+// stream. With k = 0 the stream is read in one piece (65536 at most each).
+//
+// Checked: nothing reads or writes outside its blocks (the sanitizers), the
+// messages that come out are exactly those a plain reference parser finds
+// (same order, sizes and bytes, those ahead of the first length that can't
+// be true), the progress getters agree with the reference, and every
+// allocation is given back once the socket goes.
+#include <cstddef>
+#include <cstdint>
+#include <cstdlib>
+#include <cstring>
+#include <vector>
+
+#include "N_Address.h"
+#include "N_Initializer.h"
+#include "N_Socket.h"
+#include "Q_Memory.h"
+#include "vardel_platform.h"
+#include "win32.h"
+
+struct N_SocketTestAccess {
+  static void read(N_Socket& socket, const void* bytes, unsigned int size) {
+    N_Socket::injectRead(&socket, bytes, size);
+  }
+  static bool streamBroken(const N_Socket& socket) { return socket.m_bStreamBroken; }
+};
+
+namespace {
+
+using Bytes = std::vector<unsigned char>;
+
+constexpr std::uint32_t kMaximumLength = 0x7FFFFFFB;
+
+// Records every message, keeping every other one for poll().
+class FuzzSocket : public N_Socket {
+ public:
+  bool receive(void* data, unsigned int size) override {
+    const auto* p = static_cast<const unsigned char*>(data);
+    if (size > 0 && p == nullptr) std::abort();
+    received.emplace_back(p, p + size);
+    bool keep = (received.size() & 1) != 0;
+    if (keep) kept.push_back(received.size() - 1);
+    return keep;
+  }
+  std::vector<Bytes> received;
+  std::vector<std::size_t> kept;
+};
+
+struct Expected {
+  std::vector<Bytes> messages;
+  bool broken = false;           // a length that can't be true was met
+  std::int64_t partialSize = 0;  // length + 4 of a message in collection
+  std::int64_t partialHave = 0;  // its bytes so far, prefix included
+};
+
+Expected reference(const unsigned char* stream, std::size_t size) {
+  Expected e;
+  std::size_t at = 0;
+  while (size - at >= 4) {
+    std::uint32_t length = std::uint32_t(stream[at]) | std::uint32_t(stream[at + 1]) << 8 |
+                           std::uint32_t(stream[at + 2]) << 16 | std::uint32_t(stream[at + 3]) << 24;
+    if (length > kMaximumLength) {
+      e.broken = true;
+      return e;
+    }
+    if (size - at - 4 < length) {
+      e.partialSize = std::int64_t(length) + 4;
+      e.partialHave = static_cast<std::int64_t>(size - at);
+      return e;
+    }
+    e.messages.emplace_back(stream + at + 4, stream + at + 4 + length);
+    at += 4 + length;
+  }
+  return e;
+}
+
+N_Initializer* g_network = nullptr;
+N_Address* g_loopback = nullptr;
+int g_port = 0;
+
+void startOnce() {
+  if (g_network != nullptr) return;
+  platform::setLocalHost("127.0.0.1");
+  g_network = new N_Initializer;
+  g_loopback = new N_Address("127.0.0.1");
+  // Its reverse lookup allocates on a thread of its own: let it finish, so
+  // that the allocation balance below counts this target's work alone.
+  g_loopback->wait(2.0f);
+  platform::Sleep(50);
+  // A datagram socket that talks to itself never receives anything here:
+  // the reads come from this target alone.
+  g_port = 20000 + static_cast<int>(reinterpret_cast<std::uintptr_t>(&g_port) % 20000);
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
+  startOnce();
+  if (size == 0) return 0;
+  std::size_t k = data[0] % 16;
+  std::size_t header = 1 + 2 * k;
+  if (size < header) return 0;
+  std::vector<std::size_t> cuts;
+  for (std::size_t i = 0; i < k; ++i) cuts.push_back(std::size_t(data[1 + 2 * i] | data[2 + 2 * i] << 8) + 1);
+  if (cuts.empty()) cuts.push_back(65536);
+  const unsigned char* stream = data + header;
+  std::size_t streamSize = size - header;
+
+  int newBefore = Q_Memory::sm_iNewCount.load();
+  int deleteBefore = Q_Memory::sm_iDeleteCount.load();
+  {
+    FuzzSocket socket;
+    socket.construct(g_loopback, g_port, N_Socket::SOCKET_UDP);
+    socket.enablePackage();
+    std::size_t at = 0;
+    std::size_t turn = 0;
+    while (at < streamSize) {
+      std::size_t piece = cuts[turn++ % cuts.size()];
+      if (piece > streamSize - at) piece = streamSize - at;
+      N_SocketTestAccess::read(socket, stream + at, static_cast<unsigned int>(piece));
+      at += piece;
+      int missing = socket.getReceivePacketBytesMissing();
+      int total = socket.getReceivePacketSize();
+      if (missing < 0 || total < 0 || (total == 0) != (missing == 0) || (total > 0 && total - missing < 4))
+        std::abort();
+    }
+
+    Expected e = reference(stream, streamSize);
+    bool broken = N_SocketTestAccess::streamBroken(socket);
+    // A length that can't be true breaks the stream; so may a block that
+    // can't be allocated, but only at a message that can't finish here.
+    if (e.broken && !broken) std::abort();
+    if (broken && !e.broken && e.partialSize == 0) std::abort();
+    if (socket.received != e.messages) std::abort();
+    if (!broken) {
+      if (socket.getReceivePacketSize() != (e.partialHave >= 4 ? e.partialSize : 0)) std::abort();
+      if (socket.getReceivePacketBytesMissing() != (e.partialHave >= 4 ? e.partialSize - e.partialHave : 0))
+        std::abort();
+    } else if (socket.getReceivePacketSize() != 0) {
+      std::abort();
+    }
+    // The kept messages come out of poll() whole and in order.
+    for (std::size_t index : socket.kept) {
+      void* message = nullptr;
+      unsigned int messageSize = 0;
+      if (!socket.poll(message, messageSize)) std::abort();
+      const Bytes& want = socket.received[index];
+      if (messageSize != want.size() || (messageSize > 0 && std::memcmp(message, want.data(), messageSize) != 0))
+        std::abort();
+    }
+    void* none;
+    unsigned int noneSize;
+    if (socket.poll(none, noneSize)) std::abort();
+  }
+  if (Q_Memory::sm_iNewCount.load() - newBefore != Q_Memory::sm_iDeleteCount.load() - deleteBefore) std::abort();
+  return 0;
+}

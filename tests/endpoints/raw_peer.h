@@ -1,0 +1,28 @@
+// Linux-side helpers for the transport tests that raw_socket.h doesn't give:
+// kept in their own file because Linux's socket macros clash with the
+// Winsock-shaped names of the library headers.
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <vector>
+
+namespace raw_peer {
+
+// The local port of a connected or bound socket.
+std::uint16_t localPort(int fd);
+// Small writes leave at once instead of waiting for an acknowledgement.
+void noDelay(int fd);
+// True once the peer closed (or reset) the connection within `timeoutMs`.
+bool closedByPeer(int fd, int timeoutMs);
+// Waits up to `timeoutMs` for a connection attempt on a fresh socket to be
+// refused or closed by the other side without data.
+bool refusedOrClosed(const char* ip, std::uint16_t port, int timeoutMs);
+
+// Starts `path` with `args` as a child process; its pid, or -1.
+int spawn(const std::string& path, const std::vector<std::string>& args);
+// Waits up to `timeoutMs` for the child to end; its exit code, or -1 if it
+// didn't end in time (it is killed then) or ended by a signal.
+int waitExit(int pid, int timeoutMs);
+
+}  // namespace raw_peer
