@@ -1,0 +1,138 @@
+// The accepting end of client and server connections.
+//
+// A server listens on its data port P (it is an N_Listener) and on the fixed
+// control port 6000. It has no thread: everything happens in update(), which
+// the application calls once per pass of its loop:
+//
+//   N_Server server(3123);
+//   for (;;) {
+//     server.update();
+//     N_Client* client;
+//     while (server.pollConnect(client)) welcome(client);
+//     for (each client) { client->poll(...); client->queueReliable(...); client->flushReliable(); }
+//     if (!client->isConnected()) server.disconnectClient(client);
+//   }
+//
+// update() makes an N_Client of each accepted data connection, keeps each
+// accepted control connection until a client of the same IPv4 address
+// without one exists, pairs them, and then runs the heartbeat of every
+// paired client and answers its control messages (bandwidth requests,
+// heartbeats, world-time requests, echoes). A client is handed out by
+// pollConnect() exactly once, oldest first, and only after pairing. Pairing
+// knows nothing but the address: two clients on one address may get each
+// other's control channel, so give every client host an address of its own.
+//
+// The server never removes a client by itself. A client whose channel died or
+// whose heartbeat timed out stays (isConnected() false) and keeps its share
+// of the bandwidth until the application calls disconnectClient().
+//
+// Bandwidth. Each client's share is the smaller of what it asked for and
+// getMaximumBandwidthUsage() (default 10240). If the shares together exceed
+// getBandwidth() (default 1250000), each loses the part of the excess that
+// its share has of the sum, rounded to the nearest whole byte per second,
+// ties to even; no remainder is handed on, so the grants need not add up to
+// the budget exactly. Grants are worked out again, and sent to every client
+// with a connected control channel, at every request, at each setter and at
+// every disconnectClient(). A client counts with 1250000 asked until its
+// first request. The sums are 32-bit: keep the budget and the sum of the
+// shares below 2^31. Where the rounding of a cut above 2^24 would make it
+// greater than the share, the grant is held at 0 instead of wrapping.
+//
+// After destruct(), update() and disconnectClient() do nothing and
+// pollConnect() gives false. The data port keeps accepting until the
+// listener goes (construct() again or the destructor); the control port is
+// closed.
+//
+// Threads. update(), pollConnect() and disconnectClient() take the server's
+// own re-entrant lock, so they may be called from several application
+// threads. It doesn't cover an N_Client that pollConnect() handed out: its
+// payload operations must not run beside update() on another thread.
+// construct() and destruct() must run alone. The network thread never
+// enters this class.
+//
+// A class derived from N_Server may make its own clients: allocateClient()
+// must return a constructed, non-null N_Client that consumed `pConnectData`
+// (handed it to an N_Client or N_Socket exactly once), and freeClient()
+// destroys what it made. Call destruct() in the derived destructor for
+// freeClient() to be reached at the end.
+//
+// A second server on the machine opens port 6000 as well, and nothing
+// reports that its control listener got nothing.
+#pragma once
+
+#include <atomic>
+
+#include "N_Client.h"
+#include "N_Listener.h"
+#include "Q_DLList.h"
+#include "Q_Timer.h"
+#include "vardel_export.h"
+
+class Q_Mutex;
+// White-box access for the library's own tests only.
+struct N_ServerTestAccess;
+
+class VARDEL_API N_Server : public N_Listener {
+ public:
+  explicit N_Server(int port = 3123);
+  ~N_Server();
+
+  N_Server(const N_Server&) = delete;
+  N_Server& operator=(const N_Server&) = delete;
+
+  // Throws Q_MemoryException_Allocation* when memory runs out; the server
+  // part is then unconstructed.
+  void construct(int port);
+  // Frees every client and every pending control socket.
+  void destruct();
+
+  // Exceptions of allocateClient(), of N_Socket and of N_Socket::send pass
+  // out; what was done before them in the pass stands.
+  void update();
+  // The next client that update() paired and that wasn't handed out yet.
+  bool pollConnect(N_Client*& out);
+  // Frees the client (the pointer is dead afterwards) and shares the
+  // bandwidth out again, also when the client wasn't one of this server's.
+  void disconnectClient(N_Client* client);
+
+  void setBandwidth(unsigned uBandwidth);
+  unsigned getBandwidth() const;
+  void setMaximumBandwidthUsage(unsigned uMaximumBandwidthUsage);
+  unsigned getMaximumBandwidthUsage() const;
+
+  // The world clock that clients synchronise to: its age in seconds.
+  const Q_Timer& getWorldTimer() const;
+
+ protected:
+  // Called by update() with the server's lock held.
+  virtual N_Client* allocateClient(N_Socket::ConnectData* pConnectData);
+  virtual void freeClient(N_Client* pClient);
+  bool isConstructed() const;
+
+ private:
+  friend struct N_ServerTestAccess;
+
+  // The sums of one division of the budget (see solveBandwidth).
+  struct BandwidthDivision {
+    unsigned uExcess;
+    float fTotal;
+    float fExcess;
+  };
+  static unsigned shareOf(unsigned requested, unsigned maximum);
+  static BandwidthDivision divide(unsigned budget, unsigned total);
+  static unsigned grantOf(const BandwidthDivision& division, unsigned share);
+
+  void initializeMembers();
+  void constructionCode();
+  void solveBandwidth();
+  void serveControl(N_Client* client);
+
+  bool m_bServerConstructed;
+  Q_Mutex* m_pMutex;
+  N_Listener* m_pControlListener;
+  Q_Timer m_worldTimer;
+  std::atomic<unsigned> m_uBandwidth;
+  std::atomic<unsigned> m_uMaximumBandwidthUsage;
+  Q_DLList<N_Client*>* m_pClients;
+  Q_DLList<N_Socket*>* m_pPendingControlSockets;
+};
