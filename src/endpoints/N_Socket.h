@@ -123,7 +123,8 @@ class VARDEL_API N_Socket {
   void disablePackage();
   // Ends the sending direction and reports a disconnect event (once, also if
   // the peer's close comes later). Messages already received can still be
-  // polled.
+  // polled. Messages still queued for sending (see getBytesWaitingForSend)
+  // don't leave any more: wait for the queue to drain first if they matter.
   void disconnect();
   // Copies the message at once; the caller may reuse its buffer on return.
   void send(void* data, unsigned int size);

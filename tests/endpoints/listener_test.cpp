@@ -174,7 +174,7 @@ TEST_F(ListenerTest, FailedAcceptStillMakesAnEntry) {
 // port isn't open, and the same port can be opened later.
 TEST_F(ListenerTest, RegistryEntryThatCantBeMadeLeavesNothing) {
   int port = freePort();
-  platform::fault::failAllocation(1);
+  failAllocation(1);
   try {
     N_Listener listener(port);
     FAIL() << "no exception";
@@ -196,7 +196,7 @@ TEST_F(ListenerTest, ConnectionThatCantBeQueuedIsClosed) {
   int port = freePort();
   CountingListener listener(port);
   platform::Sleep(50);
-  platform::fault::failAllocation(1);
+  failAllocation(1);
   int fd = raw::connectTo("127.0.0.1", static_cast<std::uint16_t>(port));
   ASSERT_GE(fd, 0);
   EXPECT_TRUE(raw_peer::closedByPeer(fd, 2000));

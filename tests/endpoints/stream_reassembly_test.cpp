@@ -223,8 +223,8 @@ TEST_F(StreamReassemblyTest, ZeroLengthMessagesOverTheWire) {
   write(fd, concat({framed(a), framed(empty)}));
   write(fd, Bytes{0, 0});
   write(fd, Bytes{0, 0, 0});
-  write(fd, concat({Bytes{0}, framed(a), framed(empty)}));
-  std::vector<Bytes> expected = {empty, a, empty, empty, a, empty};
+  write(fd, concat({Bytes{0, 0, 0}, framed(a), framed(empty)}));
+  std::vector<Bytes> expected = {empty, a, empty, empty, empty, a, empty};
   for (const Bytes& m : expected) {
     Bytes got{1};
     ASSERT_TRUE(pollMessage(in, got));

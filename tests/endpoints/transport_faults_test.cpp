@@ -168,7 +168,7 @@ TEST_F(TransportFaultsTest, SendThatCantBeQueuedLeavesNothingBehind) {
   // A message of four chunks: its node, block, node, block ...; each can fail.
   Bytes big = pattern(200000, 1);
   for (int nth = 1; nth <= 8; ++nth) {
-    platform::fault::failAllocation(nth);
+    failAllocation(nth);
     try {
       send(out, big);
       FAIL() << "allocation " << nth << " didn't fail";
@@ -177,7 +177,7 @@ TEST_F(TransportFaultsTest, SendThatCantBeQueuedLeavesNothingBehind) {
     }
     EXPECT_EQ(0, out.getBytesWaitingForSend()) << nth;
   }
-  platform::fault::disarmAll();
+  disarmFaults();
   ASSERT_NO_FATAL_FAILURE(exchange(out, in, 3, 800));
   EXPECT_EQ(3u, in.count());
 }
@@ -190,7 +190,7 @@ TEST_F(TransportFaultsTest, SocketThatCantBeMadeIsLeftUnconstructed) {
   N_Socket out;
   int nth = 1;
   for (;; ++nth) {
-    platform::fault::failAllocation(nth);
+    failAllocation(nth);
     bool made = false;
     try {
       out.construct(loopback(), refused, N_Socket::SOCKET_UDP);
@@ -198,7 +198,7 @@ TEST_F(TransportFaultsTest, SocketThatCantBeMadeIsLeftUnconstructed) {
     } catch (Q_MemoryException_Allocation*) {
       EXPECT_EQ(nullptr, N_Socket::getFirstSocket());
     }
-    platform::fault::disarmAll();
+    disarmFaults();
     if (made) break;
     ASSERT_LT(nth, 20);
   }
@@ -215,9 +215,9 @@ TEST_F(TransportFaultsTest, SocketThatCantBeMadeIsLeftUnconstructed) {
   ASSERT_TRUE(waitFor([&] { return m_listener->pollConnect(data); }));
   RecordingSocket in;
   settle();
-  platform::fault::failAllocation(1);
+  failAllocation(1);
   EXPECT_THROW(in.construct(data), Q_MemoryException_Allocation*);
-  platform::fault::disarmAll();
+  disarmFaults();
   N_Socket::ConnectData* again = nullptr;
   ASSERT_TRUE(m_listener->pollConnect(again));
   EXPECT_EQ(data, again);
@@ -236,14 +236,14 @@ TEST_F(TransportFaultsTest, ReadThatCantBePostedDisconnects) {
     ASSERT_TRUE(rawPeer(victim, victimFd));
     ASSERT_TRUE(rawPeer(bystander, bystanderFd));
     settle();
-    platform::fault::failAllocation(nth);
+    failAllocation(nth);
     Bytes m = framed(pattern(10, 1));
     ASSERT_TRUE(raw::sendAll(victimFd, m.data(), m.size()));
     const N_Socket* reported = nullptr;
     ASSERT_TRUE(waitFor([&] { return N_Socket::pollDisconnect(reported); }));
     EXPECT_EQ(&victim, reported);
     EXPECT_EQ(1, platform::fault::allocationsFailed());
-    platform::fault::disarmAll();
+    disarmFaults();
     ASSERT_TRUE(raw::sendAll(bystanderFd, m.data(), m.size()));
     Bytes got;
     ASSERT_TRUE(pollMessage(bystander, got));
@@ -281,12 +281,12 @@ TEST_F(TransportFaultsTest, ReassemblyThatRunsOutOfMemoryDisconnects) {
     ASSERT_TRUE(rawPeer(victim, victimFd));
     ASSERT_TRUE(rawPeer(bystander, bystanderFd));
     settle();
-    platform::fault::failAllocation(c.nth);
+    failAllocation(c.nth);
     ASSERT_TRUE(raw::sendAll(victimFd, c.stream.data(), c.stream.size()));
     const N_Socket* reported = nullptr;
     ASSERT_TRUE(waitFor([&] { return N_Socket::pollDisconnect(reported); }));
     EXPECT_EQ(&victim, reported);
-    platform::fault::disarmAll();
+    disarmFaults();
     EXPECT_EQ(0, victim.getReceivePacketSize());
     EXPECT_TRUE(N_SocketTestAccess::streamBroken(victim));
     EXPECT_EQ(0u, victim.count());
