@@ -1,0 +1,288 @@
+// One N_Client host for the client and server tests, driven line by line.
+//
+//   vardel_host_client_peer --host 127.0.0.2 --server 127.0.0.1 --port P
+//       [--hb-frequency F] [--hb-latency L] [--bandwidth B] [--seed S]
+//       [--loss X] [--delay MIN MAX] [--no-read]
+//
+// It makes its own runtime on --host, connects to the server and calls
+// update() in a loop of about a millisecond. It prints, one per line:
+//   ready                          runtime up, client constructed
+//   connected                      isConnected() became true
+//   lost                           isConnected() became false after that
+//   bandwidth N                    getBandwidth() changed (once connected)
+//   latency X                      getLatency() changed
+//   recv N TEXT                    a message of N bytes (payloads are text)
+//   sync OK SECONDS                result and duration of updateWorldTimer()
+//   time AGE                       the world timer's age
+//   queued / flushed / error TEXT  results of the queue commands
+//   bye                            at "quit", after the client is gone
+// Commands on standard input:
+//   quit | sync | time | stall SECONDS | disconnect | bandwidth N
+//   heartbeat F L | loss X | delay MIN MAX | seed S
+//   qr KEY PRIO TEXT | qu KEY PRIO TEXT    queue a reliable/unreliable payload
+//   fr | fu                                flush once
+//   send-r COUNT PREFIX | send-u COUNT PREFIX
+//        queue COUNT payloads "PREFIX<i>;" (i from 0), one every pass of
+//        the loop, flushing every pass until all have left
+//   pump on|off                            flush both queues every pass
+//   echo on|off                            queue every message back, reliably
+//   read on|off                            poll and print messages
+#include <poll.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <memory>
+#include <sstream>
+#include <string>
+#include <thread>
+
+#include "N_Address.h"
+#include "N_Client.h"
+#include "N_Exceptions.h"
+#include "N_Initializer.h"
+#include "Q_Exception.h"
+#include "Q_Timer.h"
+#include "vardel_platform.h"
+#include "win32.h"
+
+namespace {
+
+void say(const std::string& line) {
+  std::fputs(line.c_str(), stdout);
+  std::fputc('\n', stdout);
+  std::fflush(stdout);
+}
+
+// A line of standard input if one is complete; never blocks.
+bool readCommand(std::string& pending, std::string& line, bool& inputClosed) {
+  for (;;) {
+    std::size_t end = pending.find('\n');
+    if (end != std::string::npos) {
+      line = pending.substr(0, end);
+      pending.erase(0, end + 1);
+      return true;
+    }
+    if (inputClosed) return false;
+    pollfd p{0, POLLIN, 0};
+    if (::poll(&p, 1, 0) <= 0) return false;
+    char buffer[4096];
+    ssize_t got = ::read(0, buffer, sizeof buffer);
+    if (got <= 0) {
+      inputClosed = true;
+      return false;
+    }
+    pending.append(buffer, static_cast<std::size_t>(got));
+  }
+}
+
+struct Sender {
+  bool reliable = true;
+  int count = 0;
+  int next = 0;
+  std::string prefix;
+};
+
+std::string errorText(Q_Exception* e) { return e->getErrorMessage(); }
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  std::string host = "127.0.0.2";
+  std::string server = "127.0.0.1";
+  int port = 3123;
+  long bandwidth = -1;
+  bool read = true;
+  for (int i = 1; i < argc; ++i) {
+    std::string a = argv[i];
+    auto next = [&]() -> const char* { return i + 1 < argc ? argv[++i] : ""; };
+    if (a == "--host") host = next();
+    else if (a == "--server") server = next();
+    else if (a == "--port") port = std::atoi(next());
+    else if (a == "--hb-frequency") N_Client::setHeartbeatFrequency(std::strtof(next(), nullptr));
+    else if (a == "--hb-latency") N_Client::setHeartbeatLatency(std::strtof(next(), nullptr));
+    else if (a == "--bandwidth") bandwidth = std::atol(next());
+    else if (a == "--seed") platform::srand(static_cast<unsigned>(std::atol(next())));
+    else if (a == "--loss") N_Client::simulatePacketLoss(std::strtof(next(), nullptr));
+    else if (a == "--delay") {
+      unsigned lo = static_cast<unsigned>(std::atol(next()));
+      unsigned hi = static_cast<unsigned>(std::atol(next()));
+      N_Client::simulateLatency(lo, hi);
+    } else if (a == "--no-read") read = false;
+    else {
+      std::fprintf(stderr, "client_peer: unknown option %s\n", a.c_str());
+      return 2;
+    }
+  }
+
+  platform::setLocalHost(host.c_str());
+  try {
+    N_Initializer network;
+    N_Address serverAddress(server.c_str());
+    if (serverAddress.getIdentifier() == 0) {
+      say("error server address");
+      return 3;
+    }
+    auto client = std::make_unique<N_Client>(&serverAddress, port);
+    if (bandwidth >= 0) client->setBandwidth(static_cast<unsigned>(bandwidth));
+    say("ready");
+
+    bool connected = false;
+    bool everConnected = false;
+    unsigned lastBandwidth = client->getBandwidth();
+    float lastLatency = client->getLatency();
+    bool pump = false;
+    bool echo = false;
+    bool inputClosed = false;
+    std::string pending;
+    Sender sender;
+
+    for (;;) {
+      client->update();
+
+      std::string line;
+      while (readCommand(pending, line, inputClosed)) {
+        std::istringstream in(line);
+        std::string command;
+        in >> command;
+        try {
+          if (command == "quit") {
+            client.reset();
+            say("bye");
+            return 0;
+          } else if (command == "sync") {
+            Q_Timer took;
+            bool ok = client->updateWorldTimer();
+            char text[64];
+            std::snprintf(text, sizeof text, "sync %d %.6f", ok ? 1 : 0, static_cast<double>(took.getAge()));
+            say(text);
+          } else if (command == "time") {
+            char text[64];
+            std::snprintf(text, sizeof text, "time %.6f", static_cast<double>(client->getWorldTimer().getAge()));
+            say(text);
+          } else if (command == "stall") {
+            double seconds = 0;
+            in >> seconds;
+            std::this_thread::sleep_for(std::chrono::duration<double>(seconds));
+            say("resumed");
+          } else if (command == "disconnect") {
+            client->disconnect();
+          } else if (command == "bandwidth") {
+            unsigned value = 0;
+            in >> value;
+            client->setBandwidth(value);
+          } else if (command == "heartbeat") {
+            float f = 0, l = 0;
+            in >> f >> l;
+            N_Client::setHeartbeatFrequency(f);
+            N_Client::setHeartbeatLatency(l);
+          } else if (command == "loss") {
+            float loss = 0;
+            in >> loss;
+            N_Client::simulatePacketLoss(loss);
+          } else if (command == "delay") {
+            unsigned lo = 0, hi = 0;
+            in >> lo >> hi;
+            N_Client::simulateLatency(lo, hi);
+          } else if (command == "seed") {
+            unsigned seed = 0;
+            in >> seed;
+            platform::srand(seed);
+          } else if (command == "qr" || command == "qu") {
+            unsigned key = 0, priority = 0;
+            std::string text;
+            in >> key >> priority >> text;
+            if (command == "qr")
+              client->queueReliable(text.data(), static_cast<unsigned>(text.size()), key, priority);
+            else
+              client->queueUnreliable(text.data(), static_cast<unsigned>(text.size()), key, priority);
+            say("queued");
+          } else if (command == "fr") {
+            client->flushReliable();
+            say("flushed");
+          } else if (command == "fu") {
+            client->flushUnreliable();
+            say("flushed");
+          } else if (command == "send-r" || command == "send-u") {
+            sender.reliable = command == "send-r";
+            sender.next = 0;
+            in >> sender.count >> sender.prefix;
+          } else if (command == "pump") {
+            std::string on;
+            in >> on;
+            pump = on == "on";
+          } else if (command == "echo") {
+            std::string on;
+            in >> on;
+            echo = on == "on";
+          } else if (command == "read") {
+            std::string on;
+            in >> on;
+            read = on == "on";
+          } else if (!command.empty()) {
+            say("error unknown command " + command);
+          }
+        } catch (Q_Exception* e) {
+          say("error " + errorText(e));
+        }
+      }
+
+      try {
+        if (sender.next < sender.count) {
+          std::string payload = sender.prefix + std::to_string(sender.next) + ";";
+          if (sender.reliable)
+            client->queueReliable(payload.data(), static_cast<unsigned>(payload.size()), 0, 1);
+          else
+            client->queueUnreliable(payload.data(), static_cast<unsigned>(payload.size()), 0, 1);
+          ++sender.next;
+          if (sender.next == sender.count) say("sent " + std::to_string(sender.count));
+        }
+        if (read) {
+          void* message = nullptr;
+          unsigned size = 0;
+          while (client->poll(message, size)) {
+            std::string text(static_cast<const char*>(message), size);
+            say("recv " + std::to_string(size) + " " + text);
+            if (echo) client->queueReliable(text.data(), size, 0, 0);
+          }
+        }
+        if (pump || echo || sender.count > 0) {
+          client->flushReliable();
+          client->flushUnreliable();
+        }
+      } catch (Q_Exception* e) {
+        say("error " + errorText(e));
+      }
+
+      if (client->isConnected() != connected) {
+        connected = !connected;
+        if (connected) {
+          everConnected = true;
+          say("connected");
+        } else if (everConnected) {
+          say("lost");
+        }
+      }
+      if (connected && client->getBandwidth() != lastBandwidth) {
+        lastBandwidth = client->getBandwidth();
+        say("bandwidth " + std::to_string(lastBandwidth));
+      }
+      if (client->getLatency() != lastLatency) {
+        lastLatency = client->getLatency();
+        char text[64];
+        std::snprintf(text, sizeof text, "latency %.6f", static_cast<double>(lastLatency));
+        say(text);
+      }
+      if (inputClosed && pending.empty()) {
+        client.reset();
+        return 0;
+      }
+      std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    }
+  } catch (Q_Exception* e) {
+    say("error " + errorText(e));
+    return 1;
+  }
+}
