@@ -40,6 +40,7 @@ constexpr std::uint32_t kMaximumLength = 0x7FFFFFFB;
 // Records every message, keeping every other one for poll().
 class FuzzSocket : public N_Socket {
  public:
+  ~FuzzSocket() { destruct(); }
   bool receive(void* data, unsigned int size) override {
     const auto* p = static_cast<const unsigned char*>(data);
     if (size > 0 && p == nullptr) std::abort();

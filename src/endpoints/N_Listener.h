@@ -45,7 +45,10 @@ class VARDEL_API N_Listener {
 
   // Called on the network thread, with the runtime's mutex held, once for
   // each accepted connection after its entry is queued. Nothing here. An
-  // override must not wait for a thread that needs the runtime's mutex.
+  // override must not wait for a thread that needs the runtime's mutex, and
+  // its class must call destruct() in its own destructor: this destructor
+  // isn't virtual, and until destruct() the network thread may still call
+  // the override.
   virtual void receiveConnect(N_Socket::ConnectData* data);
 
  private:

@@ -26,6 +26,10 @@
 //    touch it again.
 //  - An exception thrown out of an override is dropped on the network thread
 //    and the event or message is kept, as if the override had returned true.
+//  - A derived class that overrides any of them must call destruct() in its
+//    own destructor. The destructor here isn't virtual and runs after the
+//    derived part is gone; until destruct() has unregistered the socket the
+//    network thread may still call the overrides.
 //  - destruct() on another thread while receive() runs for this socket waits
 //    until receive() has returned, so a receive() override must not wait for
 //    a thread that is destroying its socket.

@@ -12,6 +12,7 @@ class ListenerTest : public TransportTest {};
 class CountingListener : public N_Listener {
  public:
   explicit CountingListener(int port) : N_Listener(port) {}
+  ~CountingListener() { destruct(); }
   void receiveConnect(N_Socket::ConnectData* data) override {
     // The entry is queued by now: pollConnect finds it from here.
     N_Socket::ConnectData* polled = nullptr;

@@ -108,6 +108,7 @@ TEST_F(SocketObjectTest, ConstructOnALiveSocketStartsAfresh) {
 
 class FlagSocket : public N_Socket {
  public:
+  ~FlagSocket() { destruct(); }
   bool receiveConnect() override {
     ++connects;
     return keepConnect;
@@ -340,6 +341,7 @@ TEST_F(SocketObjectTest, UdpWithThePackageMechanism) {
 // read: the rest of the read is dropped and nothing touches the dead socket.
 class SelfDestroyingSocket : public N_Socket {
  public:
+  ~SelfDestroyingSocket() { destruct(); }
   bool receive(void*, unsigned int) override {
     ++calls;
     if (deleteSelf) {
@@ -347,16 +349,20 @@ class SelfDestroyingSocket : public N_Socket {
     } else {
       destruct();
     }
+    ++finished;  // static: `this` may be gone
     return true;
   }
   static std::atomic<int> calls;
+  static std::atomic<int> finished;
   bool deleteSelf = false;
 };
 std::atomic<int> SelfDestroyingSocket::calls{0};
+std::atomic<int> SelfDestroyingSocket::finished{0};
 
 TEST_F(SocketObjectTest, ReceiveMayDestroyItsOwnSocket) {
   for (bool deleteSelf : {false, true}) {
     SelfDestroyingSocket::calls = 0;
+    SelfDestroyingSocket::finished = 0;
     int port = freePort();
     N_Listener listener(port);
     auto* in = new SelfDestroyingSocket;
@@ -365,7 +371,7 @@ TEST_F(SocketObjectTest, ReceiveMayDestroyItsOwnSocket) {
     ASSERT_TRUE(acceptRaw(listener, port, *in, fd));
     Bytes stream = concat({framed(pattern(5, 1)), framed(pattern(6, 2)), framed(pattern(7, 3))});
     ASSERT_TRUE(raw::sendAll(fd, stream.data(), stream.size()));
-    ASSERT_TRUE(waitFor([&] { return SelfDestroyingSocket::calls.load() >= 1; }));
+    ASSERT_TRUE(waitFor([&] { return SelfDestroyingSocket::finished.load() >= 1; }));
     platform::Sleep(50);
     EXPECT_EQ(1, SelfDestroyingSocket::calls.load());
     EXPECT_EQ(0, registeredSockets());
@@ -377,6 +383,7 @@ TEST_F(SocketObjectTest, ReceiveMayDestroyItsOwnSocket) {
 // destruct() on another thread waits for a receive() call in progress.
 class SlowSocket : public N_Socket {
  public:
+  ~SlowSocket() { destruct(); }
   bool receive(void*, unsigned int) override {
     entered = true;
     platform::Sleep(200);
@@ -406,6 +413,7 @@ TEST_F(SocketObjectTest, DestructWaitsForAReceiveInProgress) {
 // message it was handed stays valid for its poll and is freed exactly once.
 class PollingSocket : public N_Socket {
  public:
+  ~PollingSocket() { destruct(); }
   bool receive(void* data, unsigned int size) override {
     void* polled;
     unsigned int polledSize;
@@ -456,10 +464,10 @@ TEST_F(SocketObjectTest, DestroyedSocketLeavesOrphansThatTheNetworkSideFrees) {
       }
     });
     platform::Sleep(static_cast<platform::DWORD>(5 + round * 3));
-    in.destruct();
+    in.destruct();  // resets the connection: the writer's next send fails
     stop = true;
-    raw::reset(fd);
     writer.join();
+    raw::reset(fd);
   }
 }
 

@@ -13,7 +13,7 @@ namespace {
 class SocketStressTest : public TransportTest {};
 
 constexpr int kSenders = 4;
-constexpr int kMessagesPerSender = 150;
+constexpr int kMessagesPerSender = 500;
 
 // Message: sender (1 byte), sequence (4 bytes), then a pattern of both.
 Bytes makeMessage(int sender, int sequence) {
@@ -27,6 +27,7 @@ Bytes makeMessage(int sender, int sequence) {
 // Checks each message on the network thread as it comes.
 class CheckingSocket : public N_Socket {
  public:
+  ~CheckingSocket() { destruct(); }
   bool receive(void* data, unsigned int size) override {
     const auto* p = static_cast<const unsigned char*>(data);
     if (size < 5 || p[0] >= kSenders) {

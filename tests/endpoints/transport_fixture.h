@@ -112,6 +112,7 @@ inline bool pollMessage(N_Socket& socket, Bytes& out, int milliseconds = 5000) {
 // message by `keep`.
 class RecordingSocket : public N_Socket {
  public:
+  ~RecordingSocket() { destruct(); }
   bool receive(void* data, unsigned int size) override {
     const auto* p = static_cast<const unsigned char*>(data);
     std::lock_guard<std::mutex> hold(m_lock);

@@ -16,6 +16,7 @@ class WaitSetTest : public TransportTest {};
 class CountingListener : public N_Listener {
  public:
   explicit CountingListener(int port) : N_Listener(port) {}
+  ~CountingListener() { destruct(); }
   void receiveConnect(N_Socket::ConnectData*) override { ++calls; }
   std::atomic<int> calls{0};
 };
