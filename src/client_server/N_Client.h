@@ -189,6 +189,9 @@ class VARDEL_API N_Client {
   // Drops everything queued; the flush gate stays as it is.
   void clearReliable();
   void clearUnreliable();
+  // Payload bytes waiting in each queue (what the queue limit counts).
+  unsigned getReliableBytesWaiting() const;
+  unsigned getUnreliableBytesWaiting() const;
 
   // The next message of the peer, reliable ones first. It stays the
   // socket's and is valid until the next poll(). On false the arguments

@@ -36,6 +36,10 @@ void N_Client::clearReliable() { clearQueue(m_pReliableQueue, m_uReliableBytes);
 
 void N_Client::clearUnreliable() { clearQueue(m_pUnreliableQueue, m_uUnreliableBytes); }
 
+unsigned N_Client::getReliableBytesWaiting() const { return m_uReliableBytes; }
+
+unsigned N_Client::getUnreliableBytesWaiting() const { return m_uUnreliableBytes; }
+
 void N_Client::queuePayload(Q_DLList<DataQueue>* queue, unsigned& bytes, void* pPayload, unsigned uSize, unsigned uKey,
                             unsigned uPriority) {
   // Four seconds of data at the rate in force. The bytes of an entry about
