@@ -1,9 +1,7 @@
 // The shared test fixtures do what other tests rely on: a fault guard
 // disarms, the balance sees a missing release, a child process is read,
 // written, timed out and never left behind, and a picked port is free.
-#include <netinet/in.h>
 #include <signal.h>
-#include <sys/socket.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -15,6 +13,7 @@
 #include "child_process.h"
 #include "fault_guard.h"
 #include "free_port.h"
+#include "raw_socket.h"
 #include "win32.h"
 
 namespace {
@@ -86,27 +85,26 @@ TEST(Fixtures, ChildProcessKilledBySignal) {
   EXPECT_EQ(child.wait(5000), 128 + SIGTERM);
 }
 
-bool bindable(int type, std::uint16_t port) {
-  int fd = ::socket(AF_INET, type, 0);
-  if (fd < 0) return false;
-  sockaddr_in address{};
-  address.sin_family = AF_INET;
-  address.sin_port = htons(port);
-  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  bool ok = ::bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0;
-  ::close(fd);
-  return ok;
-}
-
-TEST(Fixtures, PickedPortsAreFreeForTcpAndUdp) {
+TEST(Fixtures, PickedPortsAreFreeAndHeldPortsAreNot) {
   std::uint16_t port = pickFreePort();
   ASSERT_NE(port, 0);
-  EXPECT_TRUE(bindable(SOCK_STREAM, port));
-  EXPECT_TRUE(bindable(SOCK_DGRAM, port));
+  EXPECT_TRUE(portIsFree(port));
   std::uint16_t pair = pickFreePort(true);
   ASSERT_NE(pair, 0);
-  EXPECT_TRUE(bindable(SOCK_STREAM, pair + 1));
-  EXPECT_TRUE(bindable(SOCK_DGRAM, pair + 1));
+  EXPECT_TRUE(portIsFree(pair));
+  EXPECT_TRUE(portIsFree(pair + 1));
+
+  // Held with address reuse, as the library's sockets are, it isn't free.
+  int udp = raw::udpBound("127.0.0.1", port);
+  ASSERT_GE(udp, 0);
+  EXPECT_FALSE(portIsFree(port));
+  raw::closeFd(udp);
+  std::uint16_t listening = pair;
+  int tcp = raw::listenOn("0.0.0.0", listening);
+  ASSERT_GE(tcp, 0);
+  EXPECT_FALSE(portIsFree(pair));
+  raw::closeFd(tcp);
+  EXPECT_TRUE(portIsFree(pair));
 }
 
 }  // namespace

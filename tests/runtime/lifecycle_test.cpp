@@ -11,8 +11,12 @@
 
 #include "N_Address.h"
 #include "N_Initializer.h"
+#include "N_Listener.h"
+#include "N_Socket.h"
 #include "Q_New.h"
 #include "allocation_balance.h"
+#include "free_port.h"
+#include "raw_socket.h"
 #include "tasks.h"
 #include "vardel_platform.h"
 #include "watchdog.h"
@@ -183,6 +187,75 @@ TEST_F(Runtime, StopDeletesAddressesStillRegistered) {
     N_Address* reconstructed = Q_New<N_Address>("localhost");
     reconstructed->construct("127.0.0.1");
     EXPECT_GT(balance.outstanding(), 0);
+  }
+  EXPECT_TRUE(balance.settles());
+}
+
+// Waits for the network thread to accept a connection for `listener`.
+N_Socket::ConnectData* awaitConnection(N_Listener& listener) {
+  N_Socket::ConnectData* data = nullptr;
+  tasks::eventually([&] { return listener.pollConnect(data); }, 10.0);
+  return data;
+}
+
+// Sockets (with sends and reads in flight), a listener and addresses that
+// are still registered at the stop are deleted: their ports are closed and
+// every allocation, queue records and buffers included, is released.
+TEST_F(Runtime, StopDeletesSocketsListenersAndAddressesStillRegistered) {
+  std::uint16_t listenPort = pickFreePort();
+  std::uint16_t udpPort = pickFreePort();
+  ASSERT_NE(listenPort, 0);
+  ASSERT_NE(udpPort, 0);
+  AllocationBalance balance;
+  int peer = -1;
+  {
+    N_Initializer network;
+    N_Listener* listener = Q_New<N_Listener>(listenPort);
+    peer = raw::connectTo("127.0.0.1", listenPort);
+    ASSERT_GE(peer, 0);
+    N_Socket::ConnectData* data = awaitConnection(*listener);
+    ASSERT_NE(data, nullptr);
+    N_Socket* accepted = Q_New<N_Socket>(data);
+    char payload[1000] = {};
+    for (int i = 0; i < 20; ++i) accepted->send(payload, sizeof payload);
+    ASSERT_TRUE(raw::sendAll(peer, payload, sizeof payload));
+
+    N_Address* address = Q_New<N_Address>("127.0.0.1");
+    N_Socket* udp = Q_New<N_Socket>(address, udpPort, N_Socket::SOCKET_UDP);
+    udp->send(payload, 100);
+    EXPECT_FALSE(portIsFree(udpPort));
+    EXPECT_FALSE(portIsFree(listenPort));
+    // Let the network thread post reads and issue sends.
+    std::this_thread::sleep_for(std::chrono::milliseconds(100));
+  }
+  EXPECT_TRUE(raw::closedByPeer(peer, 10000)) << "the accepted connection wasn't closed";
+  raw::closeFd(peer);
+  EXPECT_TRUE(portIsFree(listenPort));
+  EXPECT_TRUE(portIsFree(udpPort));
+  EXPECT_TRUE(balance.settles());
+}
+
+// Connections accepted but never claimed: their records go with the stop,
+// and their sockets are closed with Winsock.
+TEST_F(Runtime, StopDropsUnclaimedConnections) {
+  std::uint16_t port = pickFreePort();
+  ASSERT_NE(port, 0);
+  AllocationBalance balance;
+  int peers[3] = {-1, -1, -1};
+  {
+    N_Initializer network;
+    N_Listener listener(port);
+    for (int& peer : peers) {
+      peer = raw::connectTo("127.0.0.1", port);
+      ASSERT_GE(peer, 0);
+    }
+    ASSERT_NE(awaitConnection(listener), nullptr);
+    std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    listener.destruct();
+  }
+  for (int peer : peers) {
+    EXPECT_TRUE(raw::closedByPeer(peer, 10000));
+    raw::closeFd(peer);
   }
   EXPECT_TRUE(balance.settles());
 }

@@ -1,8 +1,8 @@
 // The two locks, the runtime's mutex and the one shared by all addresses, are
 // taken in one order only: never the runtime's while holding the address
-// one. Threads that go both ways at once (an address destroyed on its own,
-// an address made and destroyed with the runtime's mutex held, as a socket
-// does for its peer address) must all finish. Built with the thread
+// one. Threads that go both ways at once (an address destroyed on its own;
+// sockets, which read and make and delete addresses with the runtime's mutex
+// held) must all finish. Built with the thread
 // sanitizer, this also checks the handshakes for data races. Only names the
 // hosts file answers are used: thousands of lookups at once would otherwise
 // load the machine's name server.
@@ -15,8 +15,13 @@
 
 #include "N_Address.h"
 #include "N_Initializer.h"
+#include "N_Listener.h"
+#include "N_Socket.h"
 #include "Q_New.h"
 #include "allocation_balance.h"
+#include "free_port.h"
+#include "raw_socket.h"
+#include "tasks.h"
 #include "watchdog.h"
 #include "win32.h"
 
@@ -33,12 +38,16 @@ class NetworkMutex {
   platform::HANDLE m_hMutex;
 };
 
-TEST(LockOrder, AddressesOnAllPathsAtOnce) {
+TEST(LockOrder, AddressesAndSocketsOnAllPathsAtOnce) {
   platform::setLocalHost("127.0.0.1");
+  std::uint16_t udpPort = pickFreePort();
+  std::uint16_t listenPort = pickFreePort();
+  ASSERT_NE(udpPort, 0);
+  ASSERT_NE(listenPort, 0);
   AllocationBalance balance;
   {
     N_Initializer network;
-    Watchdog dog(60.0, "addresses made and destroyed on four threads");
+    Watchdog dog(60.0, "addresses and sockets made and destroyed on six threads");
     std::atomic<bool> stop{false};
     std::atomic<int> rounds{0};
     std::vector<std::thread> threads;
@@ -68,6 +77,37 @@ TEST(LockOrder, AddressesOnAllPathsAtOnce) {
         mutex.release();
         ++rounds;
         std::this_thread::sleep_for(std::chrono::microseconds(500));
+      }
+    });
+    // Sockets read their peer's identifier with the runtime's mutex held.
+    N_Address peer("127.0.0.1");
+    threads.emplace_back([&] {
+      while (!stop) {
+        try {
+          N_Socket udp(&peer, udpPort, N_Socket::SOCKET_UDP);
+          ++rounds;
+        } catch (Q_Exception* e) {
+          ADD_FAILURE() << "socket: " << e->getErrorMessage();
+        }
+        std::this_thread::sleep_for(std::chrono::microseconds(500));
+      }
+    });
+    // An accepted socket makes its own address with the mutex held, and
+    // deletes it again in its destruct, also with the mutex held.
+    N_Listener listener(listenPort);
+    threads.emplace_back([&] {
+      while (!stop) {
+        int client = raw::connectTo("127.0.0.1", listenPort);
+        N_Socket::ConnectData* data = nullptr;
+        if (client >= 0 && tasks::eventually([&] { return listener.pollConnect(data); }, 5.0)) {
+          try {
+            N_Socket accepted(data);
+            ++rounds;
+          } catch (Q_Exception* e) {
+            ADD_FAILURE() << "accepted socket: " << e->getErrorMessage();
+          }
+        }
+        raw::closeFd(client);
       }
     });
     // Addresses left for the stop to delete.

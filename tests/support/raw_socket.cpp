@@ -140,4 +140,16 @@ std::uint16_t freePort(bool pairWithNext) {
   return 0;
 }
 
+bool closedByPeer(int fd, int timeoutMs) {
+  auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMs);
+  for (;;) {
+    auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+    if (left.count() <= 0 || !readable(fd, static_cast<int>(left.count()))) return false;
+    char buffer[4096];
+    ssize_t got = ::recv(fd, buffer, sizeof buffer, 0);
+    if (got == 0) return true;
+    if (got < 0 && errno != EINTR && errno != EAGAIN) return true;
+  }
+}
+
 }  // namespace raw

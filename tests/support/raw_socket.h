@@ -22,6 +22,9 @@ bool sendAll(int fd, const void* data, std::size_t size);
 bool receiveExactly(int fd, void* data, std::size_t size, int timeoutMs);
 // Reads whatever arrives within `timeoutMs` (until the peer closes or time ends).
 std::vector<std::uint8_t> receiveFor(int fd, int timeoutMs);
+// True once the peer has closed the connection (orderly or by reset) within
+// `timeoutMs`; data that arrives first is read and dropped.
+bool closedByPeer(int fd, int timeoutMs);
 // Closes with RST instead of FIN.
 void reset(int fd);
 void closeFd(int fd);
