@@ -146,9 +146,9 @@ Latency plainRoundTrip(std::size_t size, int rounds) {
   connectedPair(a, b);
   std::thread echo([&] {
     readMessages(b, static_cast<std::size_t>(rounds), [&](const std::uint8_t* data, std::uint32_t length) {
-      std::vector<std::uint8_t> frame(4 + length);
-      std::memcpy(frame.data(), &length, 4);
-      std::memcpy(frame.data() + 4, data, length);
+      std::vector<std::uint8_t> frame(data, data + length);
+      frame.insert(frame.begin(), reinterpret_cast<const std::uint8_t*>(&length),
+                   reinterpret_cast<const std::uint8_t*>(&length) + 4);
       return sendAll(b, frame.data(), frame.size());
     });
   });

@@ -147,8 +147,19 @@ bench::Latency libraryRoundTrip(std::size_t size, int rounds) {
 int main(int argc, char** argv) {
   if (argc == 5 && std::strcmp(argv[1], "--client-peer") == 0)
     return clientPeer(argv[2], std::atoi(argv[3]), std::atof(argv[4]));
-  bool quick = argc > 1 && std::strcmp(argv[1], "--quick") == 0;
+  bool quick = false;
+  std::size_t only = 0;  // --size N: one throughput case alone, for profiling
+  for (int i = 1; i < argc; ++i) {
+    if (std::strcmp(argv[i], "--quick") == 0) quick = true;
+    if (std::strcmp(argv[i], "--size") == 0 && i + 1 < argc) only = std::strtoul(argv[++i], nullptr, 10);
+  }
   N_Initializer network;
+  if (only != 0) {
+    bench::Throughput lib = libraryThroughput(only, (64u << 20) / (only + 64));
+    std::printf("%zu bytes: %.0f msg/s, %.1f MB/s%s\n", only, lib.messagesPerSecond, lib.megabytesPerSecond,
+                lib.verified ? "" : " (VERIFY FAILED)");
+    return 0;
+  }
   std::printf("Transport: one-way throughput over loopback, every message checked\n");
   std::printf("%10s %10s | %12s %9s | %12s %9s | %7s\n", "size", "messages", "plain msg/s", "MB/s", "vardel msg/s",
               "MB/s", "ratio");

@@ -73,40 +73,53 @@ int exchange(const char* who, N_Socket& tcp, N_Socket& udp) {
   unsigned tcpGot = 0, tcpBad = 0, udpGot = 0, udpBad = 0;
   int udpSent = 0;
   auto lastDatagram = Clock::now();
+  auto tcpDone = Clock::time_point{};
   deadline = Clock::now() + std::chrono::seconds(30);
   while (Clock::now() < deadline) {
-    // Datagrams go out at a modest pace, so that none is lost on the way.
-    if (udpSent < kDatagrams && Clock::now() - lastDatagram > std::chrono::microseconds(500)) {
+    // Datagrams go out once the stream has arrived, at a modest pace; UDP
+    // may still lose some when a receiver is busy, and each carries its
+    // number to show which.
+    if (tcpGot == tcpCount && udpSent < kDatagrams && Clock::now() - lastDatagram > std::chrono::microseconds(500)) {
       pattern(message, kDatagramSize, 1000 + static_cast<unsigned>(udpSent));
+      std::memcpy(message.data(), &udpSent, sizeof udpSent);
       udp.send(message.data(), kDatagramSize);
       ++udpSent;
       lastDatagram = Clock::now();
     }
     bool any = false;
-    while (tcp.poll(data, size)) {
+    while (tcpGot < tcpCount && tcp.poll(data, size)) {
       any = true;
       unsigned expect = tcpGot < kTcpSizes.size() ? kTcpSizes[tcpGot] : kBurstSize;
       if (!intact(data, size, expect, tcpGot)) ++tcpBad;
-      ++tcpGot;
+      if (++tcpGot == tcpCount) tcpDone = Clock::now();
     }
     while (udp.poll(data, size)) {
       any = true;
-      if (!intact(data, size, kDatagramSize, 1000 + udpGot)) ++udpBad;
+      int number = -1;
+      if (size == kDatagramSize) std::memcpy(&number, data, sizeof number);
+      std::vector<unsigned char> expect;
+      pattern(expect, kDatagramSize, 1000 + static_cast<unsigned>(number));
+      std::memcpy(expect.data(), &number, sizeof number);
+      if (number < 0 || number >= kDatagrams || std::memcmp(expect.data(), data, kDatagramSize) != 0) ++udpBad;
       ++udpGot;
     }
-    if (tcpGot == tcpCount && udpGot == kDatagrams && udpSent == kDatagrams) break;
+    bool udpOver = udpSent == kDatagrams &&
+                   (udpGot == kDatagrams || Clock::now() - lastDatagram > std::chrono::seconds(1));
+    if (tcpGot == tcpCount && udpOver) break;
     if (!any) std::this_thread::sleep_for(std::chrono::microseconds(200));
   }
-  double seconds = std::chrono::duration<double>(Clock::now() - start).count();
+  double seconds = std::chrono::duration<double>((tcpGot == tcpCount ? tcpDone : Clock::now()) - start).count();
   std::printf("[%s] TCP: sent %u messages (%.1f MB), received %u of %u, %u damaged, %.0f MB/s each way\n", who,
               tcpCount, tcpBytes / 1e6, tcpGot, tcpCount, tcpBad, tcpBytes / 1e6 / seconds);
-  std::printf("[%s] UDP: sent %d datagrams of %u bytes, received %u of %d, %u damaged\n", who, udpSent,
-              kDatagramSize, udpGot, kDatagrams, udpBad);
+  std::printf("[%s] UDP: sent %d datagrams of %u bytes, received %u of %d (unreliable: the rest was lost), %u damaged\n",
+              who, udpSent, kDatagramSize, udpGot, kDatagrams, udpBad);
   // Let the peer finish reading before this end goes away.
   tcp.send(const_cast<char*>(ready), sizeof ready);
   deadline = Clock::now() + std::chrono::seconds(5);
-  while (!tcp.poll(data, size) && Clock::now() < deadline && tcp.isConnected())
+  while (Clock::now() < deadline && tcp.isConnected()) {
+    if (tcp.poll(data, size) && size == sizeof ready) break;
     std::this_thread::sleep_for(std::chrono::milliseconds(1));
+  }
   return (tcpGot == tcpCount && tcpBad == 0 && udpBad == 0) ? 0 : 1;
 }
 
