@@ -4,8 +4,6 @@
 #pragma once
 
 #include <cstdint>
-#include <string>
-#include <vector>
 
 namespace raw_peer {
 
@@ -18,11 +16,5 @@ bool closedByPeer(int fd, int timeoutMs);
 // Waits up to `timeoutMs` for a connection attempt on a fresh socket to be
 // refused or closed by the other side without data.
 bool refusedOrClosed(const char* ip, std::uint16_t port, int timeoutMs);
-
-// Starts `path` with `args` as a child process; its pid, or -1.
-int spawn(const std::string& path, const std::vector<std::string>& args);
-// Waits up to `timeoutMs` for the child to end; its exit code, or -1 if it
-// didn't end in time (it is killed then) or ended by a signal.
-int waitExit(int pid, int timeoutMs);
 
 }  // namespace raw_peer

@@ -2,7 +2,8 @@
 // program on 127.0.0.2 exchange messages over TCP (port P) and UDP (P + 1 on
 // each side's own address). The peer sends back whatever it gets; every
 // message must come back whole, in order and byte-identical.
-#include "raw_peer.h"
+#include "child_process.h"
+#include "free_port.h"
 #include "transport_fixture.h"
 
 using namespace transport_test;
@@ -14,22 +15,14 @@ class TransportTwoProcessTest : public TransportTest {};
 const std::string kQuit = "quit-transport-peer";
 
 TEST_F(TransportTwoProcessTest, TcpAndUdpExchangeWithAPeerProcess) {
-  int port = freePort(true);
+  int port = pickFreePort(true);
   ASSERT_GT(port, 0);
   N_Listener listener(port);
   N_Address peerAddress("127.0.0.2");
   N_Socket udp(&peerAddress, port + 1, N_Socket::SOCKET_UDP);
 
-  int pid = raw_peer::spawn(VARDEL_HOST_TRANSPORT_PEER, {"--port", std::to_string(port), "--host", "127.0.0.2"});
-  ASSERT_GT(pid, 0);
-  struct Reaper {
-    int pid;
-    int code = -1;
-    bool waited = false;
-    ~Reaper() {
-      if (!waited) raw_peer::waitExit(pid, 0);
-    }
-  } reaper{pid};
+  ChildProcess peer(VARDEL_HOST_TRANSPORT_PEER, {"--port", std::to_string(port), "--host", "127.0.0.2"});
+  ASSERT_TRUE(peer.started()) << peer.startError();
 
   N_Socket::ConnectData* data = nullptr;
   ASSERT_TRUE(waitFor([&] { return listener.pollConnect(data); }, 20000));
@@ -64,9 +57,9 @@ TEST_F(TransportTwoProcessTest, TcpAndUdpExchangeWithAPeerProcess) {
   }
 
   send(tcp, Bytes(kQuit.begin(), kQuit.end()));
-  reaper.code = raw_peer::waitExit(pid, 20000);
-  reaper.waited = true;
-  EXPECT_EQ(0, reaper.code);
+  std::optional<int> code = peer.wait(20000);
+  ASSERT_TRUE(code.has_value()) << "the peer didn't end";
+  EXPECT_EQ(0, *code);
   const N_Socket* reported = nullptr;
   ASSERT_TRUE(waitFor([&] { return N_Socket::pollDisconnect(reported); }));
   EXPECT_EQ(&tcp, reported);
