@@ -138,6 +138,9 @@ void N_Socket::awaitDelivery() {
     ReleaseMutex(N_Initializer::m_hMutex);
     Sleep(1);
     WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+    // The network thread may have gone back to its wait meanwhile, on this
+    // socket's event too: it must leave it before the event is closed.
+    N_Initializer::releaseThreadLoop();
   }
 }
 

@@ -147,6 +147,18 @@ TEST_F(TransportFaultsTest, FailedEnumerationServesNoStaleEvents) {
     platform::fault::arm(Call::WSAEnumNetworkEvents, {countdown, false, platform::WSAENETDOWN});
     ASSERT_NO_FATAL_FAILURE(exchange(out, in, 5, 710 + static_cast<unsigned>(countdown) * 10));
   }
+  // A listener's failed enumeration accepts nothing twice either.
+  platform::fault::arm(Call::WSAEnumNetworkEvents, {1, false, platform::WSAENETDOWN});
+  int fd = raw::connectTo("127.0.0.1", static_cast<std::uint16_t>(m_port));
+  N_Socket::ConnectData* entry = nullptr;
+  ASSERT_TRUE(waitFor([&] { return m_listener->pollConnect(entry); }));
+  EXPECT_NE(platform::INVALID_SOCKET, entry->socket);
+  {
+    N_Socket accepted(entry);
+    EXPECT_TRUE(staysFalse([&] { return m_listener->pollConnect(entry); }, 100));
+  }
+  raw::closeFd(fd);
+
   // And a disconnect is reported once, not again by a failed enumeration.
   platform::fault::arm(Call::WSAEnumNetworkEvents, {2, false, platform::WSAENETDOWN});
   out.destruct();
