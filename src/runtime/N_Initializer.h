@@ -18,6 +18,12 @@
 // from new. A runtime that went down can be started again; the start is then
 // done anew, with a new network thread.
 //
+// The constructor returns only once the network thread runs and the local
+// address has its identifier; the destructor returns once that thread has
+// left its loop. Neither waits for anything else of the network. (A network
+// thread that the system refused to start leaves a runtime without I/O, and
+// a stop that doesn't wait for it.)
+//
 // A failed start (any exception from the first constructor) is not undone: the
 // count stays raised, so every later N_Initializer of the process is a no-op
 // and the runtime stays as far as it got. The local address is waited for at
