@@ -175,15 +175,10 @@ void ScriptedServer::hangUp() {
 
 // ---------------------------------------------------------------------------
 
-ScriptedClient::ScriptedClient(const N_Address* server, int port, bool controlFirst)
+ScriptedClient::ScriptedClient(const N_Address* server, int port, bool openDataNow, bool openControlNow)
     : m_pServer(server), m_iPort(port), m_start(Clock::now()) {
-  if (controlFirst) {
-    openControl();
-    openData();
-  } else {
-    openData();
-    openControl();
-  }
+  if (openDataNow) openData();
+  if (openControlNow) openControl();
 }
 
 ScriptedClient::~ScriptedClient() {

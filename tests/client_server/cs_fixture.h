@@ -178,11 +178,11 @@ class ScriptedServer {
 };
 
 // The client end played by plain sockets on the test thread: a data
-// connection to `port` and a control connection to 6000, opened in that
-// order (or the other when asked).
+// connection to `port` and a control connection to 6000, opened at once in
+// that order unless told otherwise.
 class ScriptedClient {
  public:
-  ScriptedClient(const N_Address* server, int port, bool controlFirst = false);
+  ScriptedClient(const N_Address* server, int port, bool openDataNow = true, bool openControlNow = true);
   ~ScriptedClient();
   void openData();
   void openControl();
@@ -205,14 +205,21 @@ class ScriptedClient {
 };
 
 // update() then pollConnect() until false, keeping the clients handed out.
-struct ServerPump {
-  N_Server& server;
-  std::vector<N_Client*> announced;
-  void operator()() {
-    server.update();
+// Copies (a Pump holds one) share the list.
+class ServerPump {
+ public:
+  explicit ServerPump(N_Server& server)
+      : m_pServer(&server), m_announced(std::make_shared<std::vector<N_Client*>>()) {}
+  void operator()() const {
+    m_pServer->update();
     N_Client* c = nullptr;
-    while (server.pollConnect(c)) announced.push_back(c);
+    while (m_pServer->pollConnect(c)) m_announced->push_back(c);
   }
+  const std::vector<N_Client*>& announced() const { return *m_announced; }
+
+ private:
+  N_Server* m_pServer;
+  std::shared_ptr<std::vector<N_Client*>> m_announced;
 };
 
 // One client host process (tests/hosts/client_peer.cpp) on 127.0.0.<n>.

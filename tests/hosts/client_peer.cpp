@@ -20,10 +20,14 @@
 //   quit | sync | time | stall SECONDS | disconnect | bandwidth N
 //   heartbeat F L | loss X | delay MIN MAX | seed S
 //   qr KEY PRIO TEXT | qu KEY PRIO TEXT    queue a reliable/unreliable payload
+//   qrn KEY PRIO SIZE CHAR | qun ...       the same with SIZE copies of CHAR
+//   limits                                 prints "limits LARGEST_UNRELIABLE"
 //   fr | fu                                flush once
-//   send-r COUNT PREFIX | send-u COUNT PREFIX
-//        queue COUNT payloads "PREFIX<i>;" (i from 0), one every pass of
-//        the loop, flushing every pass until all have left
+//   send-r COUNT PREFIX [MS] | send-u COUNT PREFIX [MS]
+//        queue COUNT payloads "PREFIX<i>;" (i from 0), each once the queue
+//        is empty again and at least MS milliseconds (default 0) after the
+//        one before, so each leaves in a message of its own; flushing every
+//        pass. Prints "sent COUNT" when the last is queued.
 //   pump on|off                            flush both queues every pass
 //   echo on|off                            queue every message back, reliably
 //   read on|off                            poll and print messages
@@ -82,7 +86,9 @@ struct Sender {
   bool reliable = true;
   int count = 0;
   int next = 0;
+  int spacingMs = 0;
   std::string prefix;
+  std::chrono::steady_clock::time_point last;
 };
 
 std::string errorText(Q_Exception* e) { return e->getErrorMessage(); }
@@ -199,6 +205,18 @@ int main(int argc, char** argv) {
             else
               client->queueUnreliable(text.data(), static_cast<unsigned>(text.size()), key, priority);
             say("queued");
+          } else if (command == "qrn" || command == "qun") {
+            unsigned key = 0, priority = 0, size = 0;
+            char fill = 'x';
+            in >> key >> priority >> size >> fill;
+            std::string text(size, fill);
+            if (command == "qrn")
+              client->queueReliable(text.data(), size, key, priority);
+            else
+              client->queueUnreliable(text.data(), size, key, priority);
+            say("queued");
+          } else if (command == "limits") {
+            say("limits " + std::to_string(client->getLargestUnreliablePacketSize()));
           } else if (command == "fr") {
             client->flushReliable();
             say("flushed");
@@ -208,7 +226,8 @@ int main(int argc, char** argv) {
           } else if (command == "send-r" || command == "send-u") {
             sender.reliable = command == "send-r";
             sender.next = 0;
-            in >> sender.count >> sender.prefix;
+            sender.spacingMs = 0;
+            in >> sender.count >> sender.prefix >> sender.spacingMs;
           } else if (command == "pump") {
             std::string on;
             in >> on;
@@ -230,7 +249,11 @@ int main(int argc, char** argv) {
       }
 
       try {
-        if (sender.next < sender.count) {
+        const unsigned waiting =
+            sender.reliable ? client->getReliableBytesWaiting() : client->getUnreliableBytesWaiting();
+        if (sender.next < sender.count && waiting == 0 &&
+            std::chrono::steady_clock::now() - sender.last >= std::chrono::milliseconds(sender.spacingMs)) {
+          sender.last = std::chrono::steady_clock::now();
           std::string payload = sender.prefix + std::to_string(sender.next) + ";";
           if (sender.reliable)
             client->queueReliable(payload.data(), static_cast<unsigned>(payload.size()), 0, 1);
@@ -261,6 +284,8 @@ int main(int argc, char** argv) {
         if (connected) {
           everConnected = true;
           say("connected");
+          lastBandwidth = client->getBandwidth();
+          say("bandwidth " + std::to_string(lastBandwidth));
         } else if (everConnected) {
           say("lost");
         }
