@@ -9,9 +9,10 @@
 // Stream format on TCP ("package mechanism", on by default for TCP, off for
 // UDP): each message is a 4-byte little-endian length followed by that many
 // payload bytes; nothing else, no magic, no checksum. A length of 0 is a valid
-// empty message. A message of any size may be sent; it leaves in chunks of at
-// most getMaximumSendPacketSize() - 16 payload bytes, which leave no trace in
-// the stream. Without the mechanism one send() is one WSASend of exactly the
+// empty message. A message of any size up to 0x7FFFFFFB bytes (the largest a
+// receiver takes) may be sent; it leaves in chunks of at most
+// getMaximumSendPacketSize() - 16 payload bytes, which leave no trace in the
+// stream. Without the mechanism one send() is one WSASend of exactly the
 // caller's bytes (one datagram on UDP) and one read is one message. Both ends
 // must agree on the mechanism; nothing in the bytes says which is in use.
 //
@@ -131,6 +132,10 @@ class VARDEL_API N_Socket {
   // don't leave any more: wait for the queue to drain first if they matter.
   void disconnect();
   // Copies the message at once; the caller may reuse its buffer on return.
+  // Works in every constructed state: before the connect completes the
+  // message waits. A WSASend that fails for another reason than a full
+  // buffer is tried again when the network thread next runs (the next send
+  // or network event), and the socket's later messages wait behind it.
   void send(void* data, unsigned int size);
   // The next message, oldest first. It stays the socket's and is valid until
   // the next poll() on this socket or its destruct(); every poll(), also one
