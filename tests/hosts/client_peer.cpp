@@ -143,7 +143,8 @@ int main(int argc, char** argv) {
     bool echo = false;
     bool inputClosed = false;
     std::string pending;
-    Sender sender;
+    Sender senders[2];  // reliable, unreliable
+    senders[1].reliable = false;
 
     for (;;) {
       client->update();
@@ -224,7 +225,7 @@ int main(int argc, char** argv) {
             client->flushUnreliable();
             say("flushed");
           } else if (command == "send-r" || command == "send-u") {
-            sender.reliable = command == "send-r";
+            Sender& sender = senders[command == "send-r" ? 0 : 1];
             sender.next = 0;
             sender.spacingMs = 0;
             in >> sender.count >> sender.prefix >> sender.spacingMs;
@@ -249,18 +250,20 @@ int main(int argc, char** argv) {
       }
 
       try {
-        const unsigned waiting =
-            sender.reliable ? client->getReliableBytesWaiting() : client->getUnreliableBytesWaiting();
-        if (sender.next < sender.count && waiting == 0 &&
-            std::chrono::steady_clock::now() - sender.last >= std::chrono::milliseconds(sender.spacingMs)) {
-          sender.last = std::chrono::steady_clock::now();
-          std::string payload = sender.prefix + std::to_string(sender.next) + ";";
-          if (sender.reliable)
-            client->queueReliable(payload.data(), static_cast<unsigned>(payload.size()), 0, 1);
-          else
-            client->queueUnreliable(payload.data(), static_cast<unsigned>(payload.size()), 0, 1);
-          ++sender.next;
-          if (sender.next == sender.count) say("sent " + std::to_string(sender.count));
+        for (Sender& sender : senders) {
+          const unsigned waiting =
+              sender.reliable ? client->getReliableBytesWaiting() : client->getUnreliableBytesWaiting();
+          if (sender.next < sender.count && waiting == 0 &&
+              std::chrono::steady_clock::now() - sender.last >= std::chrono::milliseconds(sender.spacingMs)) {
+            sender.last = std::chrono::steady_clock::now();
+            std::string payload = sender.prefix + std::to_string(sender.next) + ";";
+            if (sender.reliable)
+              client->queueReliable(payload.data(), static_cast<unsigned>(payload.size()), 0, 1);
+            else
+              client->queueUnreliable(payload.data(), static_cast<unsigned>(payload.size()), 0, 1);
+            ++sender.next;
+            if (sender.next == sender.count) say("sent " + std::to_string(sender.count));
+          }
         }
         if (read) {
           void* message = nullptr;
@@ -271,7 +274,7 @@ int main(int argc, char** argv) {
             if (echo) client->queueReliable(text.data(), size, 0, 0);
           }
         }
-        if (pump || echo || sender.count > 0) {
+        if (pump || echo || senders[0].count > 0 || senders[1].count > 0) {
           client->flushReliable();
           client->flushUnreliable();
         }
