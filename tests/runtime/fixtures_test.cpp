@@ -40,7 +40,9 @@ TEST(Fixtures, AllocationBalanceSeesWhatIsNotReleased) {
   Q_DeleteArray(kept);
   EXPECT_TRUE(balance.settles(0.05));
   EXPECT_TRUE(allocationsBalance([] { Q_DeleteArray(Q_NewArray<int>(3)); }));
-  EXPECT_FALSE(allocationsBalance([] { Q_NewArray<int>(3); }, 0.05));
+  int* leaked = nullptr;
+  EXPECT_FALSE(allocationsBalance([&] { leaked = Q_NewArray<int>(3); }, 0.05));
+  Q_DeleteArray(leaked);
 }
 
 TEST(Fixtures, ChildProcessLinesInputAndExitStatus) {
