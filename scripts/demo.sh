@@ -8,21 +8,21 @@
 #   scripts/demo.sh --help             every mode and option
 #
 # Works from any directory.
-# Environment (optional): VARDEL_BUILD_PREFIX (build tree <prefix>default,
-# default <repo>/build/), VARDEL_JOBS (parallel build jobs, default 2).
+# Environment (optional): VARDEL_BUILD_TAG (build tree build/<tag>default,
+# by default build/default), VARDEL_JOBS (parallel build jobs, default 2).
 set -euo pipefail
 
 ROOT=$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)
 cd "$ROOT"
 
-BUILD_PREFIX=${VARDEL_BUILD_PREFIX:-$ROOT/build/}
+BUILD_PREFIX="$ROOT/build/${VARDEL_BUILD_TAG:-}"
 JOBS=${VARDEL_JOBS:-2}
 dir="${BUILD_PREFIX}default"
 
 "$ROOT/scripts/install-deps.sh" >&2
 echo "demo.sh: configuring and building (preset default, $dir)" >&2
 log=$(mktemp)
-if ! cmake --preset default -B "$dir" >"$log" 2>&1; then
+if ! cmake --preset default >"$log" 2>&1; then
   cat "$log" >&2
   rm -f "$log"
   echo "demo.sh: configuring failed" >&2
@@ -34,7 +34,7 @@ if grep -q 'vardel_demo not built yet' "$log"; then
   exit 1
 fi
 rm -f "$log"
-if ! cmake --build "$dir" --parallel "$JOBS" --target vardel_demo >&2; then
+if ! cmake --build --preset default --parallel "$JOBS" --target vardel_demo >&2; then
   echo "demo.sh: building vardel_demo failed" >&2
   exit 1
 fi

@@ -5,12 +5,15 @@
 #                            presets default, asan and tsan, then build the
 #                            fuzz preset and run every fuzz target briefly
 #   scripts/test.sh quick    the default preset only
+#   scripts/test.sh asan fuzz ...   only the steps named (default, asan,
+#                            tsan, fuzz), in the order given
 #
 # Works from any directory. Stops at the first failure and says which step
 # failed; prints a summary either way.
 #
 # Environment (optional):
-#   VARDEL_BUILD_PREFIX   build trees go to <prefix><preset> (default: <repo>/build/)
+#   VARDEL_BUILD_TAG      build trees go to build/<tag><preset> (default: none,
+#                         so build/default, build/asan, ...)
 #   VARDEL_FUZZ_SECONDS   time for each fuzz target (default: 20)
 #   VARDEL_JOBS           parallel build jobs (default: 2)
 set -euo pipefail
@@ -18,20 +21,32 @@ set -euo pipefail
 ROOT=$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)
 cd "$ROOT"
 
-MODE=${1:-full}
-case "$MODE" in
-  full | quick) ;;
-  -h | --help)
-    sed -n '2,15p' "${BASH_SOURCE[0]}" | sed 's/^# \{0,1\}//'
-    exit 0
-    ;;
-  *)
-    echo "usage: scripts/test.sh [quick]" >&2
-    exit 2
-    ;;
-esac
+usage() {
+  sed -n '2,18p' "${BASH_SOURCE[0]}" | sed 's/^# \{0,1\}//'
+}
 
-BUILD_PREFIX=${VARDEL_BUILD_PREFIX:-$ROOT/build/}
+STEPS=()
+if [ $# -eq 0 ]; then
+  STEPS=(default asan tsan fuzz)
+else
+  for arg in "$@"; do
+    case "$arg" in
+      quick) STEPS+=(default) ;;
+      default | asan | tsan | fuzz) STEPS+=("$arg") ;;
+      -h | --help)
+        usage
+        exit 0
+        ;;
+      *)
+        echo "test.sh: unknown step '$arg'" >&2
+        usage >&2
+        exit 2
+        ;;
+    esac
+  done
+fi
+
+BUILD_PREFIX="$ROOT/build/${VARDEL_BUILD_TAG:-}"
 FUZZ_SECONDS=${VARDEL_FUZZ_SECONDS:-20}
 JOBS=${VARDEL_JOBS:-2}
 
@@ -82,13 +97,13 @@ run() {
 test_preset() {
   local preset=$1
   local dir="${BUILD_PREFIX}${preset}"
-  run "configure $preset" cmake --preset "$preset" -B "$dir"
-  run "build $preset" cmake --build "$dir" --parallel "$JOBS"
+  run "configure $preset" cmake --preset "$preset"
+  run "build $preset" cmake --build --preset "$preset" --parallel "$JOBS"
 
   local t0=$SECONDS log="$dir/ctest.log"
   banner "test $preset"
   set +e
-  ctest --preset "$preset" --test-dir "$dir" 2>&1 | tee "$log"
+  ctest --preset "$preset" 2>&1 | tee "$log"
   local rc=${PIPESTATUS[0]}
   set -e
   # "100% tests passed, 0 tests failed out of 42"
@@ -115,8 +130,8 @@ test_preset() {
 fuzz_smoke() {
   local preset=fuzz
   local dir="${BUILD_PREFIX}${preset}"
-  run "configure $preset" cmake --preset "$preset" -B "$dir"
-  run "build $preset" cmake --build "$dir" --parallel "$JOBS"
+  run "configure $preset" cmake --preset "$preset"
+  run "build $preset" cmake --build --preset "$preset" --parallel "$JOBS"
 
   local manifest="$dir/fuzz/fuzz_targets.txt"
   if [ ! -f "$manifest" ]; then
@@ -151,14 +166,15 @@ fuzz_smoke() {
   done <"$manifest"
 }
 
-echo "vardel tests ($MODE) in $ROOT"
+echo "vardel tests (${STEPS[*]}) in $ROOT"
 run "install dependencies" "$ROOT/scripts/install-deps.sh"
 
-test_preset default
-if [ "$MODE" = full ]; then
-  test_preset asan
-  test_preset tsan
-  fuzz_smoke
-fi
+for step in "${STEPS[@]}"; do
+  if [ "$step" = fuzz ]; then
+    fuzz_smoke
+  else
+    test_preset "$step"
+  fi
+done
 
 summary
