@@ -198,6 +198,8 @@ void N_Socket::destruct() {
       }
     }
   }
+  // Orphans may now stand anywhere in the send queue: the pump looks at all.
+  if (N_Initializer::m_pOutProcessQueue != nullptr) N_Initializer::m_pPumpFrom = N_Initializer::m_pOutProcessQueue->getFirst();
   if (m_pReceiveQueue != nullptr) {
     for (DataQueue* entry = m_pReceiveQueue->getFirst(); entry != nullptr; entry = m_pReceiveQueue->getNext(entry))
       Q_DeleteArray(entry->pBuffer);
@@ -281,12 +283,7 @@ int N_Socket::getReceivePacketBytesMissing() const {
 
 int N_Socket::getBytesWaitingForSend() const {
   WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
-  unsigned int sum = 0;
-  if (N_Initializer::m_pOutProcessQueue != nullptr) {
-    Q_DLList<DataQueue>* queue = N_Initializer::m_pOutProcessQueue;
-    for (DataQueue* entry = queue->getFirst(); entry != nullptr; entry = queue->getNext(entry))
-      sum += entry->wsaBuf.len;
-  }
+  unsigned int sum = N_Initializer::m_uBytesWaitingForSend;
   ReleaseMutex(N_Initializer::m_hMutex);
   return static_cast<int>(sum);
 }

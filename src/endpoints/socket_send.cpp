@@ -3,6 +3,7 @@
 // thread's pump issues them, and sendComplete() ends them.
 #include <cstdint>
 #include <cstring>
+#include <vector>
 
 #include "N_Initializer.h"
 #include "N_Socket.h"
@@ -53,50 +54,63 @@ void N_Socket::dropSendEntriesFrom(DataQueue* first) {
 
 void N_Socket::send(void* data, unsigned int size) {
   const char* bytes = static_cast<const char*>(data);
-  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
-  Q_DLList<DataQueue>* queue = N_Initializer::m_pOutProcessQueue;
-  DataQueue* first = nullptr;
+  const unsigned int limit = static_cast<unsigned int>(m_iMaximumSendPacketSize > 0 ? m_iMaximumSendPacketSize : 0);
+  // The copies are made before the lock is taken: a large message then holds
+  // up the network thread only for the appends, which is what keeps the
+  // entries of one message together and in order.
+  struct Chunk {
+    char* buffer;
+    unsigned int length;
+  };
+  std::vector<Chunk> chunks;
   try {
-    unsigned int limit = static_cast<unsigned int>(m_iMaximumSendPacketSize > 0 ? m_iMaximumSendPacketSize : 0);
     if (!m_bPackage) {
       if (size > limit) Q_ThrowPacketTooBig(static_cast<int>(size), m_iMaximumSendPacketSize);
-      first = queue->append();
-      prepare(first, this);
-      first->pBuffer = Q_NewArray<char>(size);
-      first->wsaBuf.buf = first->pBuffer;
-      first->wsaBuf.len = size;
-      if (size > 0) std::memcpy(first->pBuffer, bytes, size);
+      chunks.push_back({Q_NewArray<char>(size), size});
+      if (size > 0) std::memcpy(chunks.back().buffer, bytes, size);
     } else {
       unsigned int chunkLimit = limit > kChunkReserve ? limit - kChunkReserve : 1;
       unsigned int chunk = size < chunkLimit ? size : chunkLimit;
-      first = queue->append();
-      prepare(first, this);
-      first->pBuffer = Q_NewArray<char>(static_cast<std::size_t>(chunk) + 4);
-      first->wsaBuf.buf = first->pBuffer;
-      first->wsaBuf.len = chunk + 4;
+      chunks.reserve(size / chunkLimit + 1);
+      chunks.push_back({Q_NewArray<char>(static_cast<std::size_t>(chunk) + 4), chunk + 4});
       // The whole message's size, however many chunks follow.
-      writeLength(first->pBuffer, size);
-      if (chunk > 0) std::memcpy(first->pBuffer + 4, bytes, chunk);
-      unsigned int left = size - chunk;
-      unsigned int offset = chunk;
-      while (left > 0) {
-        unsigned int c = left < chunkLimit ? left : chunkLimit;
-        DataQueue* entry = queue->append();
-        prepare(entry, this);
-        entry->pBuffer = Q_NewArray<char>(c);
-        entry->wsaBuf.buf = entry->pBuffer;
-        entry->wsaBuf.len = c;
-        std::memcpy(entry->pBuffer, bytes + offset, c);
-        left -= c;
+      writeLength(chunks.back().buffer, size);
+      if (chunk > 0) std::memcpy(chunks.back().buffer + 4, bytes, chunk);
+      for (unsigned int offset = chunk; offset < size;) {
+        unsigned int c = size - offset < chunkLimit ? size - offset : chunkLimit;
+        chunks.push_back({Q_NewArray<char>(c), c});
+        std::memcpy(chunks.back().buffer, bytes + offset, c);
         offset += c;
       }
     }
   } catch (...) {
+    for (const Chunk& c : chunks) Q_DeleteArray(c.buffer);
+    throw;
+  }
+
+  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  Q_DLList<DataQueue>* queue = N_Initializer::m_pOutProcessQueue;
+  DataQueue* first = nullptr;
+  std::size_t appended = 0;
+  try {
+    for (const Chunk& c : chunks) {
+      DataQueue* entry = queue->append();
+      prepare(entry, this);
+      entry->pBuffer = c.buffer;
+      entry->wsaBuf.buf = c.buffer;
+      entry->wsaBuf.len = c.length;
+      if (first == nullptr) first = entry;
+      ++appended;
+    }
+  } catch (...) {
     // Nothing of a message that failed stays queued.
     dropSendEntriesFrom(first);
+    for (std::size_t i = appended; i < chunks.size(); ++i) Q_DeleteArray(chunks[i].buffer);
     ReleaseMutex(N_Initializer::m_hMutex);
     throw;
   }
+  for (const Chunk& c : chunks) N_Initializer::m_uBytesWaitingForSend += c.length;
+  if (N_Initializer::m_pPumpFrom == nullptr) N_Initializer::m_pPumpFrom = first;
   N_Initializer::releaseThreadLoop();
   ReleaseMutex(N_Initializer::m_hMutex);
 }
@@ -126,6 +140,8 @@ void N_Socket::sendComplete(DWORD dwError, DWORD cbTransferred, OVERLAPPED* lpOv
     socket->m_bWritable = true;
     socket->m_bWriteCompletionPending = false;
   }
+  N_Initializer::m_uBytesWaitingForSend -= entry->wsaBuf.len;
+  if (N_Initializer::m_pPumpFrom == entry) N_Initializer::m_pPumpFrom = N_Initializer::m_pOutProcessQueue->getNext(entry);
   N_Initializer::m_pOutProcessQueue->remove(entry);
   ReleaseMutex(N_Initializer::m_hMutex);
 }

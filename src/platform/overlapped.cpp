@@ -13,7 +13,7 @@ namespace {
 
 // Sends taken but not yet handed to the kernel, per socket, before WSASend
 // answers WSA_IO_PENDING instead of success.
-constexpr std::size_t kDeferLimit = 1u << 20;
+constexpr std::size_t kDeferLimit = 64u << 20;
 constexpr int kMaxGather = 1024;  // IOV_MAX on Linux
 
 void finish(Operation* op, DWORD error, DWORD bytes) {

@@ -17,7 +17,7 @@
 //    order of completion (for one socket: the order of posting).
 //  - WSASend does not write at once: like Winsock's own buffering it takes the
 //    buffer (which must stay valid until the completion) and answers 0 while
-//    the socket holds less than 1 MiB not yet taken by the kernel, otherwise
+//    the socket holds less than 64 MiB not yet taken by the kernel, otherwise
 //    WSA_IO_PENDING. The bytes go to the kernel at the issuing thread's next
 //    alertable wait, in one gathered write per socket. A thread that issues
 //    sends must therefore wait alertably, as the network thread does.

@@ -74,6 +74,8 @@ Q_DLList<N_Address*>* N_Initializer::m_pAddresses = nullptr;
 Q_DLList<N_Socket::ConnectData>* N_Initializer::m_pConnectQueue = nullptr;
 Q_DLList<N_Socket::DataQueue>* N_Initializer::m_pInProcessQueue = nullptr;
 Q_DLList<N_Socket::DataQueue>* N_Initializer::m_pOutProcessQueue = nullptr;
+N_Socket::DataQueue* N_Initializer::m_pPumpFrom = nullptr;
+unsigned int N_Initializer::m_uBytesWaitingForSend = 0;
 
 N_Initializer::N_Initializer() : m_wsaData{} {
   if (m_uInstance++ != 0) return;
@@ -104,6 +106,8 @@ void N_Initializer::start() {
   m_pConnectQueue = Q_New<Q_DLList<N_Socket::ConnectData>>();
   m_pInProcessQueue = Q_New<Q_DLList<N_Socket::DataQueue>>();
   m_pOutProcessQueue = Q_New<Q_DLList<N_Socket::DataQueue>>();
+  m_pPumpFrom = nullptr;
+  m_uBytesWaitingForSend = 0;
 
   m_hMutex = CreateMutexA(nullptr, FALSE, kNetworkMutexName);
 
@@ -219,6 +223,8 @@ void N_Initializer::stop() {
   m_pConnectQueue = nullptr;
   deleteQueue(m_pInProcessQueue);
   deleteQueue(m_pOutProcessQueue);
+  m_pPumpFrom = nullptr;
+  m_uBytesWaitingForSend = 0;
 
   WSACloseEvent(m_eventRelease);
   CloseHandle(m_hMutex);

@@ -120,4 +120,10 @@ class VARDEL_API N_Initializer {
   static Q_DLList<N_Socket::ConnectData>* m_pConnectQueue;
   static Q_DLList<N_Socket::DataQueue>* m_pInProcessQueue;
   static Q_DLList<N_Socket::DataQueue>* m_pOutProcessQueue;
+  // Kept beside the out queue so that neither the pump nor the byte count
+  // walks the whole backlog: every entry before m_pPumpFrom is issued and
+  // live (null: no entry needs the pump), and m_uBytesWaitingForSend is the
+  // sum of wsaBuf.len over the queue. Both change under m_hMutex only.
+  static N_Socket::DataQueue* m_pPumpFrom;
+  static unsigned int m_uBytesWaitingForSend;
 };

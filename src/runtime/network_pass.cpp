@@ -33,7 +33,10 @@ void N_Initializer::pumpSends() {
   static unsigned int pass = 0;
   if (++pass == 0) pass = 1;
   Q_DLList<N_Socket::DataQueue>* queue = m_pOutProcessQueue;
-  N_Socket::DataQueue* entry = queue->getFirst();
+  // Entries before m_pPumpFrom are issued and live: only their completions
+  // can change them, so the walk starts behind them.
+  N_Socket::DataQueue* entry = m_pPumpFrom;
+  N_Socket::DataQueue* firstUnsettled = nullptr;
   while (entry != nullptr) {
     N_Socket::DataQueue* next = queue->getNext(entry);
     N_Socket* socket = entry->pSocket;
@@ -42,10 +45,12 @@ void N_Initializer::pumpSends() {
       // completion: Winsock names its overlapped until then. One whose
       // completion failed is marked complete and can go.
       if (!entry->bIssued || entry->bComplete) {
+        m_uBytesWaitingForSend -= entry->wsaBuf.len;
         Q_DeleteArray(entry->pBuffer);
         entry->pBuffer = nullptr;
         entry->wsaBuf.buf = nullptr;
         queue->remove(entry);
+        entry = nullptr;
       }
     } else if (!entry->bIssued && socket->m_bWritable && socket->m_uPumpHeldPass != pass) {
       entry->overlapped.hEvent = entry;
@@ -70,8 +75,11 @@ void N_Initializer::pumpSends() {
         }
       }
     }
+    if (entry != nullptr && firstUnsettled == nullptr && (!entry->bIssued || entry->pSocket == nullptr))
+      firstUnsettled = entry;
     entry = next;
   }
+  m_pPumpFrom = firstUnsettled;
 }
 
 void N_Initializer::serveEvent(WSAEVENT handle) {
