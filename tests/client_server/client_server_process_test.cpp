@@ -187,6 +187,7 @@ TEST_F(ClientServerProcessTest, SilentEndsAreDropped) {
   EXPECT_TRUE(waitFor([&] { return !ca->isConnected(); }, 3000, pump));
   EXPECT_TRUE(a.waitLine("lost", 5000, pump));
   server.disconnectClient(ca);
+  pump.forget(ca);
 
   // ...and a server that stops calling update is dropped by its client.
   PeerProcess b(3, port(), heartbeat("0.2", "0.2"));
