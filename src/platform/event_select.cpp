@@ -186,7 +186,9 @@ int WSAEnumNetworkEvents(SOCKET s, WSAEVENT hEventObject, WSANETWORKEVENTS* lpNe
   if (lpNetworkEvents == nullptr) return detail::fail(WSAEFAULT);
   std::shared_ptr<detail::EventObject> event = hEventObject ? detail::findEvent(hEventObject) : nullptr;
   std::lock_guard<std::mutex> hold(socket->lock);
-  detail::refresh(*socket);
+  // The waits record what poll reports; look at the socket here only when
+  // nothing is recorded yet (a caller that enumerates without waiting).
+  if ((socket->recorded & socket->selected) == 0) detail::refresh(*socket);
   lpNetworkEvents->lNetworkEvents = socket->recorded & socket->selected;
   std::memcpy(lpNetworkEvents->iErrorCode, socket->errors, sizeof socket->errors);
   socket->recorded = 0;
