@@ -2,6 +2,7 @@
 // cut at arbitrary points, and the library socket must hand out the same
 // messages whole, in order, however the reads fell. Where the exact cut of a
 // read matters, the read is fed to the receive path directly.
+#include <algorithm>
 #include <random>
 
 #include "raw_peer.h"
@@ -159,17 +160,23 @@ TEST_F(StreamReassemblyTest, SeveralMessagesInOneRead) {
   N_Socket in(loopback(), refused, N_Socket::SOCKET_TCP);
   Bytes a = pattern(7, 1), b = pattern(0, 2), c = pattern(33, 3);
 
-  int before = Q_Memory::sm_iNewCount.load();
-  N_SocketTestAccess::readString(in, framed(a));
-  int alone = Q_Memory::sm_iNewCount.load() - before;
-
-  before = Q_Memory::sm_iNewCount.load();
-  N_SocketTestAccess::readString(in, concat({framed(a), framed(b), framed(c)}));
-  int three = Q_Memory::sm_iNewCount.load() - before;
+  // Other threads (a resolver finishing, say) may allocate meanwhile: the
+  // least of a few rounds is what the read itself cost.
+  auto cost = [&](const Bytes& read) {
+    int least = 1 << 30;
+    for (int round = 0; round < 3; ++round) {
+      int before = Q_Memory::sm_iNewCount.load();
+      N_SocketTestAccess::readString(in, read);
+      least = std::min(least, Q_Memory::sm_iNewCount.load() - before);
+    }
+    return least;
+  };
+  int alone = cost(framed(a));
+  int three = cost(concat({framed(a), framed(b), framed(c)}));
   // Two copies and two more nodes than a single message needs.
   EXPECT_EQ(alone + 4, three);
 
-  std::vector<Bytes> expected = {a, a, b, c};
+  std::vector<Bytes> expected = {a, a, a, a, b, c, a, b, c, a, b, c};
   for (const Bytes& m : expected) {
     Bytes got;
     ASSERT_TRUE(pollMessage(in, got, 0));
