@@ -54,7 +54,7 @@
 // the application can split again by their own contents may share a batch.
 // Unreliable payloads must stay within getLargestUnreliablePacketSize().
 //
-// Choices this class makes where the design leaves room:
+// Edge cases, as this class settles them:
 //  - With the bandwidth at 0 a flush sends nothing and changes nothing (the
 //    queue and the gate stay as they are), and a queue operation accepts only
 //    zero-size payloads, since the queue limit is then 0.
