@@ -30,6 +30,7 @@ using Clock = std::chrono::steady_clock;
 // Counts and checks messages on the network thread, freeing each at once.
 class CheckingSocket : public N_Socket {
  public:
+  ~CheckingSocket() { destruct(); }  // before the derived part goes: the network thread may call receive()
   std::size_t expectedSize = 0;
   std::atomic<std::uint64_t> received{0};
   std::atomic<bool> corrupt{false};
@@ -45,6 +46,7 @@ class CheckingSocket : public N_Socket {
 // Sends every message straight back.
 class EchoSocket : public N_Socket {
  public:
+  ~EchoSocket() { destruct(); }
   bool receive(void* data, unsigned int size) override {
     send(data, size);
     return false;
@@ -54,6 +56,7 @@ class EchoSocket : public N_Socket {
 // Hands each reply to the waiting application thread.
 class ReplySocket : public N_Socket {
  public:
+  ~ReplySocket() { destruct(); }
   std::mutex lock;
   std::condition_variable arrived;
   std::vector<std::uint8_t> reply;

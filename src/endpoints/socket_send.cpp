@@ -3,6 +3,7 @@
 // thread's pump issues them, and sendComplete() ends them.
 #include <cstdint>
 #include <cstring>
+#include <new>
 #include <vector>
 
 #include "N_Initializer.h"
@@ -83,6 +84,10 @@ void N_Socket::send(void* data, unsigned int size) {
         offset += c;
       }
     }
+  } catch (const std::bad_alloc&) {
+    // The list of chunks itself could not grow: reported like any allocation.
+    for (const Chunk& c : chunks) Q_DeleteArray(c.buffer);
+    Q_ThrowAllocation();
   } catch (...) {
     for (const Chunk& c : chunks) Q_DeleteArray(c.buffer);
     throw;

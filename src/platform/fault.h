@@ -67,7 +67,8 @@ std::string_view name(Call call);
 // The Nth allocation from now gives nothing (1: the next one); with persist,
 // every allocation from then on.
 void failAllocation(int nth, bool persist = false);
-// Allocations that the fault made give nothing, since it was armed.
+// Allocations that the fault made give nothing, since it was armed (or since
+// disarmAll).
 int allocationsFailed();
 
 // Replaces the provider catalogue that WSAEnumProtocolsA reports, until
