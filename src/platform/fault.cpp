@@ -83,7 +83,6 @@ void disarmAll() {
   s.allocationCountdown = 0;
   s.allocationPersist = false;
   s.allocationFiring = false;
-  s.allocationsFailed = 0;
   g_allocationArmed.store(false, std::memory_order_relaxed);
   s.catalogueSet = false;
   s.catalogue.clear();

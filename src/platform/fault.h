@@ -67,8 +67,7 @@ std::string_view name(Call call);
 // The Nth allocation from now gives nothing (1: the next one); with persist,
 // every allocation from then on.
 void failAllocation(int nth, bool persist = false);
-// Allocations that the fault made give nothing, since it was armed (or since
-// disarmAll).
+// Allocations that the fault made give nothing, since it was armed.
 int allocationsFailed();
 
 // Replaces the provider catalogue that WSAEnumProtocolsA reports, until

@@ -64,6 +64,10 @@ void closeLocked(SocketState& socket) {
   }
   socket.event.reset();
   socket.selected = 0;
+  // A listening socket stops listening now: a wait on another thread may
+  // still hold the descriptor in its poll, and close alone would keep the
+  // port bound until that poll returns, failing a new listener's bind.
+  if (socket.phase == Phase::Listening && socket.fd >= 0) ::shutdown(socket.fd, SHUT_RDWR);
   if (socket.fd >= 0) ::close(socket.fd);
   socket.fd = -1;
 }
