@@ -12,7 +12,13 @@ N_Server::N_Server(int port) : N_Listener(port) {
   constructionCode();
 }
 
-N_Server::~N_Server() { destruct(); }
+N_Server::~N_Server() {
+  destruct();
+  // The data port is closed while this is still an N_Server: once the
+  // destructor of the base begins, the object's type changes under the
+  // network thread, which may be calling receiveConnect on it.
+  N_Listener::destruct();
+}
 
 void N_Server::initializeMembers() {
   m_bServerConstructed = false;
