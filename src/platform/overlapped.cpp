@@ -39,6 +39,14 @@ int gather(const Operation& op, iovec* iov, int room) {
   return n;
 }
 
+// One non-blocking gathered send of `count` pieces; -1 with errno on failure.
+ssize_t sendGathered(int fd, iovec* iov, int count) {
+  msghdr message{};
+  message.msg_iov = iov;
+  message.msg_iovlen = static_cast<std::size_t>(count);
+  return ::sendmsg(fd, &message, MSG_NOSIGNAL | MSG_DONTWAIT);
+}
+
 void failSends(SocketState& socket, int err) {
   DWORD code = static_cast<DWORD>(wsaErrorFromErrno(err));
   while (!socket.sends.empty()) {
@@ -60,10 +68,7 @@ void progressStreamSends(SocketState& socket) {
       for (int i = n; i < n + added; ++i) offered += iov[i].iov_len;
       n += added;
     }
-    msghdr message{};
-    message.msg_iov = iov;
-    message.msg_iovlen = static_cast<std::size_t>(n);
-    ssize_t written = ::sendmsg(socket.fd, &message, MSG_NOSIGNAL | MSG_DONTWAIT);
+    ssize_t written = sendGathered(socket.fd, iov, n);
     if (written < 0) {
       if (errno == EINTR) continue;
       if (errno == EAGAIN || errno == EWOULDBLOCK) {
@@ -105,10 +110,7 @@ void progressDatagramSends(SocketState& socket) {
   while (!socket.sends.empty()) {
     Operation* op = socket.sends.front();
     int n = gather(*op, iov, 8);
-    msghdr message{};
-    message.msg_iov = iov;
-    message.msg_iovlen = static_cast<std::size_t>(n);
-    ssize_t written = ::sendmsg(socket.fd, &message, MSG_NOSIGNAL | MSG_DONTWAIT);
+    ssize_t written = sendGathered(socket.fd, iov, n);
     if (written < 0) {
       if (errno == EINTR) continue;
       if (errno == EAGAIN || errno == EWOULDBLOCK) {
