@@ -65,8 +65,6 @@ namespace {
 
 using Bytes = std::vector<unsigned char>;
 
-constexpr std::uint32_t kMaximumLength = 0x7FFFFFFB;
-
 // Records every message, keeping every other one for poll().
 class FuzzSocket : public N_Socket {
  public:
@@ -90,13 +88,13 @@ struct Expected {
   std::int64_t partialHave = 0;  // its bytes so far, prefix included
 };
 
-Expected reference(const unsigned char* stream, std::size_t size) {
+Expected reference(const unsigned char* stream, std::size_t size, std::uint32_t maximumLength) {
   Expected e;
   std::size_t at = 0;
   while (size - at >= 4) {
     std::uint32_t length = std::uint32_t(stream[at]) | std::uint32_t(stream[at + 1]) << 8 |
                            std::uint32_t(stream[at + 2]) << 16 | std::uint32_t(stream[at + 3]) << 24;
-    if (length > kMaximumLength) {
+    if (length > maximumLength) {
       e.broken = true;
       return e;
     }
@@ -135,6 +133,10 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   startOnce();
   if (size == 0) return 0;
   std::size_t k = data[0] % 16;
+  // Either set of limits: the largest length differs, and the open network's
+  // compact messages copy short ones and grow long ones as they arrive.
+  N_Initializer::setLimits((data[0] & 16) != 0 ? N_Limits::openNetwork() : N_Limits::defaults());
+  const std::uint32_t maximumLength = N_Initializer::getLimits().uMaximumMessageSize;
   std::size_t header = 1 + 2 * k;
   if (size < header) return 0;
   std::vector<std::size_t> cuts;
@@ -163,7 +165,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
         std::abort();
     }
 
-    Expected e = reference(stream, streamSize);
+    Expected e = reference(stream, streamSize, maximumLength);
     bool broken = N_SocketTestAccess::streamBroken(socket);
     // A length that can't be true breaks the stream; so may a block that
     // can't be allocated, but only at a message that can't finish here.

@@ -57,6 +57,8 @@ void N_Client::initializeMembers() {
   m_pUnreliableQueue = nullptr;
   m_uReliableBytes = 0;
   m_uUnreliableBytes = 0;
+  m_pairingTimer.reset();
+  m_bGrantAsked = false;
 }
 
 void N_Client::construct(const N_Address* pAddress, int iPort) {
@@ -90,6 +92,7 @@ void N_Client::construct(N_Socket::ConnectData* pConnectData, int iPort) {
     m_uBandwidth = DEFAULT_BANDWIDTH;
     // The server end waits for the client's heartbeat first.
     m_heartbeatState = HEARTBEAT_AWAIT_PEER;
+    m_pairingTimer.reset();
     m_heartbeatTimer.reset();
     m_heartbeatIdleTimer.reset();
     m_worldTimer.reset();

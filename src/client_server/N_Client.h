@@ -242,6 +242,10 @@ class VARDEL_API N_Client {
   Q_DLList<DataQueue>* m_pUnreliableQueue;
   unsigned m_uReliableBytes;
   unsigned m_uUnreliableBytes;
+  // Server end: the age since the connection was accepted, for the pairing
+  // time limit; and a bandwidth request came since the last division.
+  Q_Timer m_pairingTimer;
+  bool m_bGrantAsked;
 
   static std::atomic<float> sm_fHeartbeatFrequency;
   static std::atomic<float> sm_fHeartbeatLatency;

@@ -3,6 +3,7 @@
 
 #include "ControlMessage.h"
 #include "N_Address.h"
+#include "N_Initializer.h"
 #include "Q_Mutex.h"
 #include "Q_New.h"
 
@@ -28,6 +29,8 @@ void N_Server::initializeMembers() {
   m_uMaximumBandwidthUsage = 0;
   m_pClients = nullptr;
   m_pPendingControlSockets = nullptr;
+  m_bSolvePending = false;
+  m_bSolveCollected = false;
 }
 
 void N_Server::construct(int port) {
@@ -44,7 +47,7 @@ void N_Server::constructionCode() {
     m_worldTimer.reset();
     m_pMutex = Q_New<Q_Mutex>();
     m_pClients = Q_New<Q_DLList<N_Client*>>();
-    m_pPendingControlSockets = Q_New<Q_DLList<N_Socket*>>();
+    m_pPendingControlSockets = Q_New<Q_DLList<PendingControl>>();
     m_pControlListener = Q_New<N_Listener>(ControlMessage::CONTROL_PORT);
   } catch (...) {
     destruct();
@@ -63,10 +66,10 @@ void N_Server::destruct() {
     m_pClients = nullptr;
   }
   if (m_pPendingControlSockets != nullptr) {
-    for (N_Socket** entry = m_pPendingControlSockets->getFirst(); entry != nullptr;
+    for (PendingControl* entry = m_pPendingControlSockets->getFirst(); entry != nullptr;
          entry = m_pPendingControlSockets->getNext(entry)) {
-      Q_Delete(*entry);
-      *entry = nullptr;
+      Q_Delete(entry->pSocket);
+      entry->pSocket = nullptr;
     }
     Q_Delete(m_pPendingControlSockets);
     m_pPendingControlSockets = nullptr;
@@ -89,40 +92,120 @@ void N_Server::freeClient(N_Client* pClient) { Q_Delete(pClient); }
 void N_Server::update() {
   if (!m_bServerConstructed) return;
   Q_MutexLock lock(m_pMutex);
+  const N_Limits limits = N_Initializer::getLimits();
+  acceptData(limits);
+  acceptControl(limits);
+  if (limits.fPairingTimeout > 0.0f) dropUnpaired(limits.fPairingTimeout);
+  pair();
+  for (N_Client** entry = m_pClients->getFirst(); entry != nullptr; entry = m_pClients->getNext(entry)) {
+    N_Client* client = *entry;
+    if (sendBacklogExceeded(client, limits)) client->disconnect();
+    serveControl(client, limits);
+  }
+  if (m_bSolvePending || m_bSolveCollected) {
+    const bool changedOnly = !m_bSolvePending;
+    // Cleared first: a division that throws is due again at the next update.
+    m_bSolveCollected = false;
+    m_bSolvePending = true;
+    solveBandwidth(changedOnly);
+    m_bSolvePending = false;
+  }
+}
 
+void N_Server::acceptData(const N_Limits& limits) {
   // Data connections become clients at once; they stay invisible to the
   // application until their control channel is paired.
   N_Socket::ConnectData* data = nullptr;
   while (N_Listener::pollConnect(data)) {
+    // An accept that failed (no descriptor left) carries no connection.
+    if (data->socket == platform::INVALID_SOCKET ||
+        !admitUnpaired(limits, data->address.sin_addr.s_addr)) {
+      N_Listener::rejectConnect(data);
+      continue;
+    }
     N_Client** slot = m_pClients->append();
     try {
       *slot = allocateClient(data);
     } catch (...) {
       m_pClients->remove(slot);
-      throw;
+      if (!limits.bContainFailures) throw;
+      // Still queued if the client never took it over.
+      N_Listener::rejectConnect(data);
     }
   }
+}
 
+void N_Server::acceptControl(const N_Limits& limits) {
+  N_Socket::ConnectData* data = nullptr;
   while (m_pControlListener->pollConnect(data)) {
-    N_Socket** slot = m_pPendingControlSockets->append();
+    if (data->socket == platform::INVALID_SOCKET ||
+        !admitUnpaired(limits, data->address.sin_addr.s_addr)) {
+      m_pControlListener->rejectConnect(data);
+      continue;
+    }
+    PendingControl* slot = m_pPendingControlSockets->append();
+    slot->age.reset();
     try {
-      *slot = Q_New<N_Socket>(data);
+      slot->pSocket = Q_New<N_Socket>(data);
     } catch (...) {
       m_pPendingControlSockets->remove(slot);
-      throw;
+      if (!limits.bContainFailures) throw;
+      m_pControlListener->rejectConnect(data);
     }
   }
+}
 
+bool N_Server::admitUnpaired(const N_Limits& limits, unsigned identifier) {
+  if (limits.uMaximumUnpaired == 0 && limits.uMaximumUnpairedPerAddress == 0) return true;
+  unsigned all = 0;
+  unsigned same = 0;
+  for (N_Client** entry = m_pClients->getFirst(); entry != nullptr; entry = m_pClients->getNext(entry)) {
+    if ((*entry)->m_pControlSocket != nullptr) continue;
+    ++all;
+    if ((*entry)->getAddress()->getIdentifier() == identifier) ++same;
+  }
+  for (PendingControl* entry = m_pPendingControlSockets->getFirst(); entry != nullptr;
+       entry = m_pPendingControlSockets->getNext(entry)) {
+    ++all;
+    if (entry->pSocket->getAddress()->getIdentifier() == identifier) ++same;
+  }
+  if (limits.uMaximumUnpaired != 0 && all >= limits.uMaximumUnpaired) return false;
+  return limits.uMaximumUnpairedPerAddress == 0 || same < limits.uMaximumUnpairedPerAddress;
+}
+
+void N_Server::dropUnpaired(float timeout) {
+  // Never handed out, so the application can't remove them itself.
+  for (N_Client** entry = m_pClients->getFirst(); entry != nullptr;) {
+    N_Client** next = m_pClients->getNext(entry);
+    N_Client* client = *entry;
+    if (client->m_pControlSocket == nullptr &&
+        (client->m_pairingTimer.getAge() > timeout || !client->m_pTcpSocket->isConnected())) {
+      freeClient(client);
+      m_pClients->remove(entry);
+    }
+    entry = next;
+  }
+  for (PendingControl* entry = m_pPendingControlSockets->getFirst(); entry != nullptr;) {
+    PendingControl* next = m_pPendingControlSockets->getNext(entry);
+    if (entry->age.getAge() > timeout || !entry->pSocket->isConnected()) {
+      Q_Delete(entry->pSocket);
+      m_pPendingControlSockets->remove(entry);
+    }
+    entry = next;
+  }
+}
+
+void N_Server::pair() {
   // A control connection belongs to the oldest client of the same IPv4
   // address that has none yet; either may arrive first, and an unmatched
   // one waits for a later update.
-  for (N_Socket** pending = m_pPendingControlSockets->getFirst(); pending != nullptr;) {
-    N_Socket** nextPending = m_pPendingControlSockets->getNext(pending);
-    const unsigned identifier = (*pending)->getAddress()->getIdentifier();
+  for (PendingControl* pending = m_pPendingControlSockets->getFirst(); pending != nullptr;) {
+    PendingControl* nextPending = m_pPendingControlSockets->getNext(pending);
+    const unsigned identifier = pending->pSocket->getAddress()->getIdentifier();
     for (N_Client** entry = m_pClients->getFirst(); entry != nullptr; entry = m_pClients->getNext(entry)) {
       N_Client* client = *entry;
       if (client->m_pControlSocket != nullptr || client->getAddress()->getIdentifier() != identifier) continue;
-      client->m_pControlSocket = *pending;
+      client->m_pControlSocket = pending->pSocket;
       client->m_bNewConnection = true;
       client->m_heartbeatTimer.reset();
       client->m_heartbeatIdleTimer.reset();
@@ -131,25 +214,39 @@ void N_Server::update() {
     }
     pending = nextPending;
   }
-
-  for (N_Client** entry = m_pClients->getFirst(); entry != nullptr; entry = m_pClients->getNext(entry))
-    serveControl(*entry);
 }
 
-void N_Server::serveControl(N_Client* client) {
+bool N_Server::sendBacklogExceeded(N_Client* client, const N_Limits& limits) {
+  if (limits.fSendBacklogSeconds <= 0.0f || !client->isConnected()) return false;
+  double bound = static_cast<double>(limits.fSendBacklogSeconds) * client->m_uBandwidth;
+  if (bound < limits.uMinimumSendBacklog) bound = limits.uMinimumSendBacklog;
+  for (N_Socket* socket : {client->m_pTcpSocket, client->m_pUdpSocket, client->m_pControlSocket})
+    if (socket != nullptr && socket->getQueuedSendBytes() > bound) return true;
+  return false;
+}
+
+void N_Server::serveControl(N_Client* client, const N_Limits& limits) {
   N_Socket* control = client->m_pControlSocket;
   if (control == nullptr || !control->isConnected()) return;
   client->stepHeartbeat();
   void* data = nullptr;
   unsigned size = 0;
   // Tested before every read: a channel lost midway ends the reading there.
-  while (control->isConnected() && control->poll(data, size)) {
+  // What the budget leaves waits for the next update.
+  for (unsigned served = 0; (limits.uControlBudget == 0 || served < limits.uControlBudget) &&
+                            control->isConnected() && control->poll(data, size);
+       ++served) {
     ControlMessage message;
     if (!message.decode(data, size)) continue;
     switch (message.uType) {
       case ControlMessage::CONTROL_BANDWIDTH_REQUEST:
         client->m_uRequestedBandwidth = message.uValue;
-        solveBandwidth();
+        if (limits.bCoalesceBandwidth) {
+          client->m_bGrantAsked = true;
+          m_bSolveCollected = true;
+        } else {
+          solveBandwidth();
+        }
         break;
       case ControlMessage::CONTROL_HEARTBEAT:
         client->receiveHeartbeat();
@@ -191,14 +288,23 @@ void N_Server::disconnectClient(N_Client* client) {
   for (N_Client** entry = m_pClients->getFirst(); entry != nullptr;) {
     N_Client** next = m_pClients->getNext(entry);
     if (*entry == client) {
-      freeClient(client);
+      try {
+        freeClient(client);
+      } catch (...) {
+        // A derived freeClient that fails loses its object, not the list.
+      }
       *entry = nullptr;
       m_pClients->remove(entry);
     }
     entry = next;
   }
-  // The others get the freed part back in this same call.
-  solveBandwidth();
+  // The others get the freed part back in this same call, or, if a grant
+  // can't be sent now, at the next update.
+  try {
+    solveBandwidth();
+  } catch (...) {
+    m_bSolvePending = true;
+  }
 }
 
 void N_Server::setBandwidth(unsigned uBandwidth) {

@@ -58,11 +58,21 @@
 //
 // A second server on the machine opens port 6000 as well, and nothing
 // reports that its control listener got nothing.
+//
+// On the open network, call N_Initializer::setLimits(N_Limits::openNetwork())
+// first: unpaired connections then have a time limit and a cap, a client
+// that doesn't read what it is sent is disconnected, each update() serves a
+// bounded number of control messages per client and divides the bandwidth
+// at most once, and a connection that can't be taken is refused without
+// costing the other clients their update (N_Limits.h, and the README).
+// Whatever the limits, an accept that failed (no descriptor left) never
+// becomes a client.
 #pragma once
 
 #include <atomic>
 
 #include "N_Client.h"
+#include "N_Limits.h"
 #include "N_Listener.h"
 #include "Q_DLList.h"
 #include "Q_Timer.h"
@@ -86,13 +96,20 @@ class VARDEL_API N_Server : public N_Listener {
   // Frees every client and every pending control socket.
   void destruct();
 
-  // Exceptions of allocateClient(), of N_Socket and of N_Socket::send pass
-  // out; what was done before them in the pass stands.
+  // Throws what allocateClient() throws (by default Q_MemoryException_-
+  // Allocation* or the exceptions of N_Socket's construction) and what
+  // N_Socket::send throws (Q_MemoryException_Allocation*); what was done
+  // before in the pass stands. With N_Limits::bContainFailures a connection
+  // that can't be made into a client or control socket is refused instead,
+  // and only N_Socket::send's exceptions pass out.
   void update();
   // The next client that update() paired and that wasn't handed out yet.
+  // Never throws.
   bool pollConnect(N_Client*& out);
   // Frees the client (the pointer is dead afterwards) and shares the
   // bandwidth out again, also when the client wasn't one of this server's.
+  // Never throws: grants that can't be sent now are sent by the next
+  // update().
   void disconnectClient(N_Client* client);
 
   void setBandwidth(unsigned uBandwidth);
@@ -112,6 +129,12 @@ class VARDEL_API N_Server : public N_Listener {
  private:
   friend struct N_ServerTestAccess;
 
+  // An accepted control connection waiting for its client.
+  struct PendingControl {
+    N_Socket* pSocket;
+    Q_Timer age;  // since it was accepted
+  };
+
   // The sums of one division of the budget (see solveBandwidth).
   struct BandwidthDivision {
     unsigned uExcess;
@@ -124,8 +147,17 @@ class VARDEL_API N_Server : public N_Listener {
 
   void initializeMembers();
   void constructionCode();
-  void solveBandwidth();
-  void serveControl(N_Client* client);
+  // Divides the budget and sends the grants; with `changedOnly` only to
+  // clients whose grant changed or that asked since the last division.
+  void solveBandwidth(bool changedOnly = false);
+  void acceptData(const N_Limits& limits);
+  void acceptControl(const N_Limits& limits);
+  // Whether one more connection of `identifier` may wait to be paired.
+  bool admitUnpaired(const N_Limits& limits, unsigned identifier);
+  void dropUnpaired(float timeout);
+  void pair();
+  bool sendBacklogExceeded(N_Client* client, const N_Limits& limits);
+  void serveControl(N_Client* client, const N_Limits& limits);
 
   bool m_bServerConstructed;
   Q_Mutex* m_pMutex;
@@ -134,5 +166,10 @@ class VARDEL_API N_Server : public N_Listener {
   std::atomic<unsigned> m_uBandwidth;
   std::atomic<unsigned> m_uMaximumBandwidthUsage;
   Q_DLList<N_Client*>* m_pClients;
-  Q_DLList<N_Socket*>* m_pPendingControlSockets;
+  Q_DLList<PendingControl>* m_pPendingControlSockets;
+  // A division is due at the end of the next update(): in full after one
+  // that failed (m_bSolvePending), or for the requests collected in this
+  // one (m_bSolveCollected).
+  bool m_bSolvePending;
+  bool m_bSolveCollected;
 };

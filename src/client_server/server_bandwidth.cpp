@@ -43,7 +43,7 @@ unsigned N_Server::grantOf(const BandwidthDivision& division, unsigned share) {
   return share - static_cast<unsigned>(whole);
 }
 
-void N_Server::solveBandwidth() {
+void N_Server::solveBandwidth(bool changedOnly) {
   if (!m_bServerConstructed) return;
   Q_MutexLock lock(m_pMutex);
   const unsigned maximum = m_uMaximumBandwidthUsage;
@@ -57,10 +57,12 @@ void N_Server::solveBandwidth() {
   for (N_Client** entry = m_pClients->getFirst(); entry != nullptr; entry = m_pClients->getNext(entry)) {
     N_Client* client = *entry;
     const unsigned grant = grantOf(division, shareOf(client->m_uRequestedBandwidth, maximum));
+    // By default sent whether it changed or not; a client without a live
+    // control channel keeps the value here and hears nothing.
+    const bool tell = !changedOnly || grant != client->m_uBandwidth || client->m_bGrantAsked;
+    client->m_bGrantAsked = false;
     client->m_uBandwidth = grant;
-    // Sent whether it changed or not; a client without a live control
-    // channel keeps the value here and hears nothing.
-    if (client->m_pControlSocket != nullptr && client->m_pControlSocket->isConnected())
+    if (tell && client->m_pControlSocket != nullptr && client->m_pControlSocket->isConnected())
       N_Client::sendControl(client->m_pControlSocket, ControlMessage::CONTROL_BANDWIDTH_GRANT, grant);
   }
 }

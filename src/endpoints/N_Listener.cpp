@@ -33,6 +33,8 @@ void N_Listener::initializeMembers() {
   std::memset(&m_requestedAddress, 0, sizeof m_requestedAddress);
   std::memset(&m_localAddress, 0, sizeof m_localAddress);
   m_pRegistryEntry = nullptr;
+  m_restTimer.reset();
+  m_fRestSeconds = 0.0f;
 }
 
 bool N_Listener::isConstructed() const { return m_bConstructed; }
@@ -104,6 +106,22 @@ bool N_Listener::pollConnect(N_Socket::ConnectData*& out) {
         break;
       }
     }
+  }
+  ReleaseMutex(N_Initializer::m_hMutex);
+  return found;
+}
+
+bool N_Listener::rejectConnect(N_Socket::ConnectData* data) {
+  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  bool found = false;
+  Q_DLList<N_Socket::ConnectData>* queue = N_Initializer::m_pConnectQueue;
+  for (N_Socket::ConnectData* entry = queue != nullptr ? queue->getFirst() : nullptr; entry != nullptr;
+       entry = queue->getNext(entry)) {
+    if (entry != data || entry->pListener != this) continue;
+    if (entry->socket != INVALID_SOCKET && entry->socket != 0) N_Socket::chkErr(closesocket(entry->socket));
+    queue->remove(entry);
+    found = true;
+    break;
   }
   ReleaseMutex(N_Initializer::m_hMutex);
   return found;

@@ -15,6 +15,7 @@
 #pragma once
 
 #include "N_Socket.h"
+#include "Q_Timer.h"
 #include "vardel_export.h"
 #include "vardel_platform.h"
 
@@ -42,6 +43,10 @@ class VARDEL_API N_Listener {
   // The oldest accepted connection of this listener, left in the queue.
   // False, with `out` untouched, if there is none.
   bool pollConnect(N_Socket::ConnectData*& out);
+  // Refuses an entry that pollConnect() gave instead of handing it over:
+  // closes its connection and frees it. The pointer is dead afterwards.
+  // False (and nothing done) if it isn't an entry of this listener.
+  bool rejectConnect(N_Socket::ConnectData* data);
 
   // Called on the network thread, with the runtime's mutex held, once for
   // each accepted connection after its entry is queued. Nothing here. An
@@ -64,4 +69,9 @@ class VARDEL_API N_Listener {
   platform::sockaddr_in m_requestedAddress;
   platform::sockaddr_in m_localAddress;
   N_Listener** m_pRegistryEntry;
+  // After an accept failed for lack of descriptors or memory the network
+  // thread leaves the listener out of its wait for m_fRestSeconds, counted
+  // by m_restTimer.
+  Q_Timer m_restTimer;
+  float m_fRestSeconds;
 };

@@ -65,6 +65,11 @@ void N_Socket::initializeMembers() {
   m_bStreamBroken = false;
   m_pDelivering = nullptr;
   m_uPumpHeldPass = 0;
+  m_iPacketCapacity = 0;
+  m_uQueuedSendBytes = 0;
+  m_uQueuedReceiveBytes = 0;
+  m_bReadPaused = false;
+  m_bReadResume = false;
 }
 
 void N_Socket::baseConstructor() {
@@ -242,6 +247,7 @@ bool N_Socket::poll(void*& data, unsigned int& size) {
         data = entry->wsaBuf.buf;
         size = entry->wsaBuf.len;
         entry->bConsumed = true;
+        m_uQueuedReceiveBytes -= entry->wsaBuf.len;
         found = true;
         break;
       }
@@ -252,6 +258,12 @@ bool N_Socket::poll(void*& data, unsigned int& size) {
       }
       entry = next;
     }
+  }
+  if (m_bReadPaused && m_uQueuedReceiveBytes < N_Initializer::getLimits().uReceiveBacklog) {
+    m_bReadPaused = false;
+    m_bReadResume = true;
+    N_Initializer::m_bReadsToResume = true;
+    N_Initializer::releaseThreadLoop();
   }
   ReleaseMutex(N_Initializer::m_hMutex);
   return found;
@@ -286,6 +298,20 @@ int N_Socket::getBytesWaitingForSend() const {
   unsigned int sum = N_Initializer::m_uBytesWaitingForSend;
   ReleaseMutex(N_Initializer::m_hMutex);
   return static_cast<int>(sum);
+}
+
+unsigned int N_Socket::getQueuedSendBytes() const {
+  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  unsigned int bytes = m_uQueuedSendBytes;
+  ReleaseMutex(N_Initializer::m_hMutex);
+  return bytes;
+}
+
+unsigned int N_Socket::getQueuedReceiveBytes() const {
+  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  unsigned int bytes = m_uQueuedReceiveBytes;
+  ReleaseMutex(N_Initializer::m_hMutex);
+  return bytes;
 }
 
 N_Socket** N_Socket::getFirstSocket() {

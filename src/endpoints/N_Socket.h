@@ -148,6 +148,12 @@ class VARDEL_API N_Socket {
   // Bytes waiting to be sent by every socket of the process (4 more per
   // packaged message), counted until their completion has run.
   int getBytesWaitingForSend() const;
+  // This socket's own share of that: bytes still to be sent, prefixes
+  // included.
+  unsigned int getQueuedSendBytes() const;
+  // Bytes of received messages that poll() hasn't handed out yet. With a
+  // receive backlog set (N_Limits) the socket stops reading at that bound.
+  unsigned int getQueuedReceiveBytes() const;
 
   static N_Socket** getFirstSocket();
   static N_Socket** getNextSocket(N_Socket** socket);
@@ -189,9 +195,17 @@ class VARDEL_API N_Socket {
   // bool results are false when the socket was destroyed during a receive()
   // call; the caller must not touch it again then.
   void postRead();
-  bool receivePlain(DataQueue* read, unsigned int bytes);
-  bool receivePackaged(DataQueue* read, unsigned int bytes);
-  bool finishInRead(DataQueue* read, char* payload, unsigned int size, bool last);
+  // What the receive path takes from N_Limits, read once per read.
+  struct ReadLimits {
+    std::uint32_t uMaximumLength;
+    bool bCompact;
+  };
+  bool receivePlain(DataQueue* read, unsigned int bytes, const ReadLimits& limits);
+  bool receivePackaged(DataQueue* read, unsigned int bytes, const ReadLimits& limits);
+  bool finishInRead(DataQueue* read, char* payload, unsigned int size, bool last, const ReadLimits& limits);
+  // Makes room for `needed` bytes of the message in collection, of `total`
+  // bytes in all, growing the block at least twofold.
+  void reserveCollected(std::int64_t needed, std::int64_t total);
   bool deliver(DataQueue* read, DataQueue* message);
   DataQueue* appendMessage(char* buffer, char* data, unsigned int size);
   void breakStream();
@@ -233,4 +247,15 @@ class VARDEL_API N_Socket {
   // reason it retries later; the socket's later entries wait for that retry,
   // so that the stream keeps its order.
   unsigned int m_uPumpHeldPass;
+  // Bytes allocated for m_pPacketBuffer while a body is collected; below
+  // length + 4 while a long message grows with what arrived.
+  std::int64_t m_iPacketCapacity;
+  // Sums kept under the runtime's mutex: bytes of this socket on the
+  // out-queue, and of its messages that poll() hasn't handed out.
+  unsigned int m_uQueuedSendBytes;
+  unsigned int m_uQueuedReceiveBytes;
+  // Reading stopped at the receive backlog; poll() sets m_bReadResume when
+  // the backlog fell below it, and the network thread then posts the read.
+  bool m_bReadPaused;
+  bool m_bReadResume;
 };

@@ -27,9 +27,11 @@ using namespace platform;
 namespace {
 
 constexpr unsigned int kReadSize = 65536;
-// The largest length whose block (length + 4) still fits a 32-bit int.
-constexpr std::uint32_t kMaximumLength = 0x7FFFFFFB;
 constexpr int kPrefixSlack = 1024;
+// With compact messages on: a message shorter than this is copied out of the
+// read buffer rather than keeping all of it, and the block of a long message
+// starts at this size and doubles as the bytes arrive.
+constexpr unsigned int kCompactBelow = 16384;
 
 // True on the network thread while it runs a receive() override.
 thread_local bool tl_bInReceive = false;
@@ -86,6 +88,7 @@ void N_Socket::postRead() {
 void N_Socket::breakStream() {
   Q_DeleteArray(m_pPacketBuffer);
   m_pPacketBuffer = nullptr;
+  m_iPacketCapacity = 0;
   m_iPacketBytesMissing = 0;
   m_iPacketBytesHave = 0;
   m_bStreamBroken = true;
@@ -106,6 +109,7 @@ N_Socket::DataQueue* N_Socket::appendMessage(char* buffer, char* data, unsigned 
   message->bConsumed = false;
   message->bLive = true;
   message->pSocket = this;
+  m_uQueuedReceiveBytes += size;
   return message;
 }
 
@@ -127,6 +131,7 @@ bool N_Socket::deliver(DataQueue* read, DataQueue* message) {
   m_pDelivering = nullptr;
   // A message that poll() handed out meanwhile stays for the next poll().
   if (!keep && !message->bConsumed) {
+    m_uQueuedReceiveBytes -= message->wsaBuf.len;
     Q_DeleteArray(message->pBuffer);
     m_pReceiveQueue->remove(message);
   }
@@ -144,9 +149,10 @@ void N_Socket::awaitDelivery() {
   }
 }
 
-bool N_Socket::receivePlain(DataQueue* read, unsigned int bytes) {
+bool N_Socket::receivePlain(DataQueue* read, unsigned int bytes, const ReadLimits& limits) {
   DataQueue* message;
   try {
+    if (limits.bCompact && bytes < kCompactBelow) return finishInRead(read, read->wsaBuf.buf, bytes, false, limits);
     message = appendMessage(read->pBuffer, read->wsaBuf.buf, bytes);
   } catch (Q_MemoryException*) {
     breakStream();
@@ -157,9 +163,10 @@ bool N_Socket::receivePlain(DataQueue* read, unsigned int bytes) {
   return deliver(read, message);
 }
 
-bool N_Socket::finishInRead(DataQueue* read, char* payload, unsigned int size, bool last) {
+bool N_Socket::finishInRead(DataQueue* read, char* payload, unsigned int size, bool last, const ReadLimits& limits) {
   DataQueue* message;
-  if (!last) {
+  // In place, a short message would keep the whole read buffer.
+  if (!last || (limits.bCompact && size < kCompactBelow)) {
     char* copy = Q_NewArray<char>(size);
     if (size > 0) std::memcpy(copy, payload, size);
     try {
@@ -176,7 +183,17 @@ bool N_Socket::finishInRead(DataQueue* read, char* payload, unsigned int size, b
   return deliver(read, message);
 }
 
-bool N_Socket::receivePackaged(DataQueue* read, unsigned int bytes) {
+void N_Socket::reserveCollected(std::int64_t needed, std::int64_t total) {
+  if (needed <= m_iPacketCapacity) return;
+  std::int64_t capacity = std::min(total, std::max(needed, 2 * m_iPacketCapacity));
+  char* block = Q_NewArray<char>(static_cast<std::size_t>(capacity));
+  std::memcpy(block, m_pPacketBuffer, static_cast<std::size_t>(m_iPacketBytesHave));
+  Q_DeleteArray(m_pPacketBuffer);
+  m_pPacketBuffer = block;
+  m_iPacketCapacity = capacity;
+}
+
+bool N_Socket::receivePackaged(DataQueue* read, unsigned int bytes, const ReadLimits& limits) {
   if (m_bStreamBroken) return true;
   // 64-bit arithmetic: a length near 2^31 must not wrap the comparisons.
   std::int64_t left = bytes;
@@ -197,15 +214,18 @@ bool N_Socket::receivePackaged(DataQueue* read, unsigned int bytes) {
           return true;
         }
         std::uint32_t length = readLength(cursor);
-        if (length > kMaximumLength) {
+        if (length > limits.uMaximumLength) {
           breakStream();
           return true;
         }
         if (left - length - 4 < 0) {
-          // The message spans reads: collect it at its final size.
+          // The message spans reads: collect it at its final size, or with
+          // compact messages in a block that grows as the bytes come.
+          const std::int64_t total = std::int64_t(length) + 4;
           Q_DeleteArray(m_pPacketBuffer);
           m_pPacketBuffer = nullptr;
-          m_pPacketBuffer = Q_NewArray<char>(std::size_t(length) + 4);
+          m_iPacketCapacity = limits.bCompact ? std::min(total, std::max<std::int64_t>(left, kCompactBelow)) : total;
+          m_pPacketBuffer = Q_NewArray<char>(static_cast<std::size_t>(m_iPacketCapacity));
           std::memcpy(m_pPacketBuffer, cursor, static_cast<std::size_t>(left));
           m_iPacketBytesMissing = static_cast<int>(length + 4 - left);
           m_iPacketBytesHave = static_cast<int>(left);
@@ -214,7 +234,7 @@ bool N_Socket::receivePackaged(DataQueue* read, unsigned int bytes) {
         char* payload = cursor + 4;
         left -= 4 + std::int64_t(length);
         cursor = payload + length;
-        if (!finishInRead(read, payload, length, left == 0)) return false;
+        if (!finishInRead(read, payload, length, left == 0, limits)) return false;
         continue;
       }
       if (missing < 0) {
@@ -229,19 +249,23 @@ bool N_Socket::receivePackaged(DataQueue* read, unsigned int bytes) {
         cursor += n;
         left -= n;
         std::uint32_t length = readLength(m_pPacketBuffer);
-        if (length > kMaximumLength) {
+        if (length > limits.uMaximumLength) {
           breakStream();
           return true;
         }
-        char* block = Q_NewArray<char>(std::size_t(length) + 4);
+        const std::int64_t total = std::int64_t(length) + 4;
+        const std::int64_t capacity = limits.bCompact ? std::min<std::int64_t>(total, kCompactBelow) : total;
+        char* block = Q_NewArray<char>(static_cast<std::size_t>(capacity));
         std::memcpy(block, m_pPacketBuffer, 4);
         Q_DeleteArray(m_pPacketBuffer);
         m_pPacketBuffer = block;
+        m_iPacketCapacity = capacity;
         have = 4;
         missing = length;
         m_iPacketBytesHave = 4;
         m_iPacketBytesMissing = static_cast<int>(length);
       }
+      reserveCollected(have + std::min(missing, left), have + missing);
       if (missing > left) {
         if (left > 0) std::memcpy(m_pPacketBuffer + have, cursor, static_cast<std::size_t>(left));
         m_iPacketBytesMissing = static_cast<int>(missing - left);
@@ -254,6 +278,7 @@ bool N_Socket::receivePackaged(DataQueue* read, unsigned int bytes) {
       left -= missing;
       DataQueue* message = appendMessage(m_pPacketBuffer, m_pPacketBuffer + 4, static_cast<unsigned int>(have - 4));
       m_pPacketBuffer = nullptr;
+      m_iPacketCapacity = 0;
       m_iPacketBytesMissing = 0;
       m_iPacketBytesHave = 0;
       if (!deliver(read, message)) return false;
@@ -292,10 +317,12 @@ void N_Initializer::receiveComplete(DWORD error, DWORD bytes, OVERLAPPED* overla
   N_Socket* socket = read->pSocket;
   if (read->bLive && socket != nullptr) {
     unsigned int size = std::min<unsigned int>(bytes, read->wsaBuf.len);
+    const N_Limits limits = getLimits();
+    const N_Socket::ReadLimits readLimits{limits.uMaximumMessageSize, limits.bCompactMessages};
     if (socket->m_bPackage)
-      socket->receivePackaged(read, size);
+      socket->receivePackaged(read, size, readLimits);
     else
-      socket->receivePlain(read, size);
+      socket->receivePlain(read, size, readLimits);
   }
   Q_DeleteArray(read->pBuffer);
   read->pBuffer = nullptr;

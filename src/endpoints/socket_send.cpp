@@ -114,7 +114,10 @@ void N_Socket::send(void* data, unsigned int size) {
     ReleaseMutex(N_Initializer::m_hMutex);
     throw;
   }
-  for (const Chunk& c : chunks) N_Initializer::m_uBytesWaitingForSend += c.length;
+  for (const Chunk& c : chunks) {
+    N_Initializer::m_uBytesWaitingForSend += c.length;
+    m_uQueuedSendBytes += c.length;
+  }
   if (N_Initializer::m_pPumpFrom == nullptr) N_Initializer::m_pPumpFrom = first;
   N_Initializer::releaseThreadLoop();
   ReleaseMutex(N_Initializer::m_hMutex);
@@ -146,6 +149,7 @@ void N_Socket::sendComplete(DWORD dwError, DWORD cbTransferred, OVERLAPPED* lpOv
     socket->m_bWriteCompletionPending = false;
   }
   N_Initializer::m_uBytesWaitingForSend -= entry->wsaBuf.len;
+  if (socket != nullptr) socket->m_uQueuedSendBytes -= entry->wsaBuf.len;
   if (N_Initializer::m_pPumpFrom == entry) N_Initializer::m_pPumpFrom = N_Initializer::m_pOutProcessQueue->getNext(entry);
   N_Initializer::m_pOutProcessQueue->remove(entry);
   ReleaseMutex(N_Initializer::m_hMutex);

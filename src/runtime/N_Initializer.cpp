@@ -76,6 +76,7 @@ Q_DLList<N_Socket::DataQueue>* N_Initializer::m_pInProcessQueue = nullptr;
 Q_DLList<N_Socket::DataQueue>* N_Initializer::m_pOutProcessQueue = nullptr;
 N_Socket::DataQueue* N_Initializer::m_pPumpFrom = nullptr;
 unsigned int N_Initializer::m_uBytesWaitingForSend = 0;
+bool N_Initializer::m_bReadsToResume = false;
 
 N_Initializer::N_Initializer() : m_wsaData{} {
   if (m_uInstance++ != 0) return;
@@ -108,6 +109,7 @@ void N_Initializer::start() {
   m_pOutProcessQueue = Q_New<Q_DLList<N_Socket::DataQueue>>();
   m_pPumpFrom = nullptr;
   m_uBytesWaitingForSend = 0;
+  m_bReadsToResume = false;
 
   m_hMutex = CreateMutexA(nullptr, FALSE, kNetworkMutexName);
 
@@ -250,9 +252,11 @@ unsigned int N_Initializer::threadNetwork(void*) {
   int failedWaits = 0;
   while (m_threadState.load() == THREAD_RUNNING) {
     DWORD count = 1;
+    DWORD timeout = WSA_INFINITE;
     events[0] = m_eventRelease;
     try {
-      count = buildWaitSet(events);
+      count = buildWaitSet(events, timeout);
+      resumeReads();
       pumpSends();
     } catch (...) {
       // Nothing may leave this thread; what failed is tried on the next pass.
@@ -260,7 +264,7 @@ unsigned int N_Initializer::threadNetwork(void*) {
     ReleaseMutex(mutex);
 
     // Completion routines run inside this wait and take the mutex themselves.
-    DWORD result = WSAWaitForMultipleEvents(count, events, FALSE, WSA_INFINITE, TRUE);
+    DWORD result = WSAWaitForMultipleEvents(count, events, FALSE, timeout, TRUE);
     if (m_threadState.load() != THREAD_RUNNING) break;
 
     // A wait that keeps failing (a broken release event, say) must not turn

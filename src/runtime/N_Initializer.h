@@ -38,6 +38,7 @@
 #include <atomic>
 #include <cstdint>
 
+#include "N_Limits.h"
 #include "N_Socket.h"
 #include "Q_DLList.h"
 #include "vardel_export.h"
@@ -65,6 +66,12 @@ class VARDEL_API N_Initializer {
   // Body of the network thread. The parameter isn't read; returns 0.
   static unsigned int threadNetwork(void* parameter);
 
+  // The process-wide protections (N_Limits.h). May be called at any time,
+  // before the first instance too; what runs picks the values up at its next
+  // step.
+  static void setLimits(const N_Limits& limits);
+  static N_Limits getLimits();
+
  private:
   friend class N_Address;
   friend class N_Socket;
@@ -90,7 +97,12 @@ class VARDEL_API N_Initializer {
 
   // One pass of the network thread, with m_hMutex held (network_pass.cpp).
   // Fills events[0..count) with the release event first and returns count.
-  static platform::DWORD buildWaitSet(platform::WSAEVENT* events);
+  // A listener resting after a failed accept is left out; `timeout` is set
+  // to the milliseconds until the first of them may come back (or INFINITE).
+  static platform::DWORD buildWaitSet(platform::WSAEVENT* events, platform::DWORD& timeout);
+  // Posts the reads of sockets whose receive backlog has fallen below its
+  // bound since their reading paused.
+  static void resumeReads();
   static void pumpSends();
   static void serveEvent(platform::WSAEVENT handle);
   // Completion routine of the reads that the pass posts.
@@ -126,4 +138,7 @@ class VARDEL_API N_Initializer {
   // sum of wsaBuf.len over the queue. Both change under m_hMutex only.
   static N_Socket::DataQueue* m_pPumpFrom;
   static unsigned int m_uBytesWaitingForSend;
+  // Set (under m_hMutex) when a paused socket may read again; the next pass
+  // walks the sockets for it.
+  static bool m_bReadsToResume;
 };

@@ -13,18 +13,47 @@
 
 using namespace platform;
 
-DWORD N_Initializer::buildWaitSet(WSAEVENT* events) {
+DWORD N_Initializer::buildWaitSet(WSAEVENT* events, DWORD& timeout) {
+  const bool listenersFirst = getLimits().bListenersFirst;
   DWORD count = 0;
+  timeout = WSA_INFINITE;
   events[count++] = m_eventRelease;
-  // Sockets first: with 63 sockets or more no listener is waited on. The
-  // lists keep their order, so the same objects stay out until others go.
+  auto addListeners = [&] {
+    for (N_Listener** slot = m_pListeners->getFirst(); slot != nullptr && count < WSA_MAXIMUM_WAIT_EVENTS;
+         slot = m_pListeners->getNext(slot)) {
+      N_Listener* listener = *slot;
+      if (listener == nullptr) continue;
+      // Resting after a failed accept: the wait ends when the rest does.
+      float rest = listener->m_fRestSeconds - listener->m_restTimer.getAge();
+      if (rest > 0.0f) {
+        DWORD milliseconds = static_cast<DWORD>(rest * 1000.0f) + 1;
+        if (milliseconds < timeout) timeout = milliseconds;
+        continue;
+      }
+      listener->m_fRestSeconds = 0.0f;
+      events[count++] = listener->m_event;
+    }
+  };
+  // By default sockets come first: with 63 sockets or more no listener is
+  // waited on. The lists keep their order, so the same objects stay out
+  // until others go.
+  if (listenersFirst) addListeners();
   for (N_Socket** slot = m_pSockets->getFirst(); slot != nullptr && count < WSA_MAXIMUM_WAIT_EVENTS;
        slot = m_pSockets->getNext(slot))
     if (*slot != nullptr) events[count++] = (*slot)->m_event;
-  for (N_Listener** slot = m_pListeners->getFirst(); slot != nullptr && count < WSA_MAXIMUM_WAIT_EVENTS;
-       slot = m_pListeners->getNext(slot))
-    if (*slot != nullptr) events[count++] = (*slot)->m_event;
+  if (!listenersFirst) addListeners();
   return count;
+}
+
+void N_Initializer::resumeReads() {
+  if (!m_bReadsToResume) return;
+  m_bReadsToResume = false;
+  for (N_Socket** slot = m_pSockets->getFirst(); slot != nullptr; slot = m_pSockets->getNext(slot)) {
+    N_Socket* socket = *slot;
+    if (socket == nullptr || !socket->m_bReadResume) continue;
+    socket->m_bReadResume = false;
+    socket->postRead();
+  }
 }
 
 void N_Initializer::pumpSends() {
@@ -114,7 +143,15 @@ void N_Initializer::serveEvent(WSAEVENT handle) {
       }
       if (keep) socket->m_bEventPending = true;
     }
-    if (what & FD_READ) socket->postRead();
+    if (what & FD_READ) {
+      // A socket whose unpolled messages passed the bound stops reading, so
+      // that the peer's TCP waits; poll() lets it go on.
+      unsigned backlog = getLimits().uReceiveBacklog;
+      if (backlog != 0 && socket->m_uQueuedReceiveBytes >= backlog)
+        socket->m_bReadPaused = true;
+      else
+        socket->postRead();
+    }
     if (what & FD_WRITE) socket->m_bWritable = true;
     if (what & FD_CLOSE) {
       try {
@@ -147,9 +184,16 @@ void N_Initializer::serveEvent(WSAEVENT handle) {
     int length = sizeof entry->address;
     entry->socket = N_Socket::chkErr(
         WSAAccept(listener->m_socket, reinterpret_cast<sockaddr*>(&entry->address), &length, nullptr, 0));
-    if (WSAGetLastError() == WSAECONNREFUSED) {
+    int error = WSAGetLastError();
+    if (error == WSAECONNREFUSED) {
       m_pConnectQueue->remove(entry);
       return;
+    }
+    if (entry->socket == INVALID_SOCKET && (error == WSAEMFILE || error == WSAENOBUFS)) {
+      // The connection stays in the system's backlog; retrying at once would
+      // spin on it until a descriptor is free.
+      listener->m_fRestSeconds = getLimits().fAcceptBackoff;
+      listener->m_restTimer.reset();
     }
     try {
       listener->receiveConnect(entry);

@@ -171,6 +171,37 @@ TEST_F(ListenerTest, FailedAcceptStillMakesAnEntry) {
   raw::closeFd(fd);
 }
 
+// An accept that fails for lack of descriptors doesn't spin on the waiting
+// connection: the listener rests between tries and takes the connection once
+// accepts work again. An entry can be refused, which closes its connection.
+TEST_F(ListenerTest, FailedAcceptsRestAndEntriesCanBeRefused) {
+  int port = freePort();
+  CountingListener listener(port);
+  platform::fault::arm(platform::fault::Call::WSAAccept, {1, true, platform::WSAEMFILE});
+  int fd = raw::connectTo("127.0.0.1", static_cast<std::uint16_t>(port));
+  platform::Sleep(1000);
+  platform::fault::disarm(platform::fault::Call::WSAAccept);
+  // One try per rest of a quarter second, however loaded the machine.
+  int tries = listener.calls.load();
+  EXPECT_GE(tries, 1);
+  EXPECT_LE(tries, 7);
+  N_Socket::ConnectData* entry = nullptr;
+  auto nextValid = [&] {
+    while (listener.pollConnect(entry)) {
+      if (entry->socket != platform::INVALID_SOCKET) return true;
+      EXPECT_TRUE(listener.rejectConnect(entry));
+    }
+    return false;
+  };
+  ASSERT_TRUE(waitFor(nextValid));
+  N_Listener other(freePort());
+  EXPECT_FALSE(other.rejectConnect(entry));
+  EXPECT_TRUE(listener.rejectConnect(entry));
+  EXPECT_FALSE(listener.pollConnect(entry));
+  EXPECT_TRUE(raw::closedByPeer(fd, 5000));
+  raw::closeFd(fd);
+}
+
 // Memory for the registry entry runs out: nothing of the attempt stays, the
 // port isn't open, and the same port can be opened later.
 TEST_F(ListenerTest, RegistryEntryThatCantBeMadeLeavesNothing) {

@@ -5,6 +5,7 @@
 // nothing.
 #include <vector>
 
+#include "limits_guard.h"
 #include "transport_fixture.h"
 
 using namespace transport_test;
@@ -72,6 +73,22 @@ TEST_F(WaitSetTest, SocketsComeFirstAndWhatDoesNotFitWaits) {
 
   sockets.clear();
   for (int fd : peers) raw::closeFd(fd);
+}
+
+// With listeners first, no number of sockets keeps a connection out.
+TEST_F(WaitSetTest, ListenersFirstAreAlwaysWaitedOn) {
+  LimitsGuard open(N_Limits::openNetwork());
+  std::vector<std::unique_ptr<N_Socket>> sockets;
+  for (int i = 0; i < 70; ++i) {
+    sockets.push_back(std::make_unique<N_Socket>());
+    sockets.back()->construct(loopback(), freePort(), N_Socket::SOCKET_UDP);
+  }
+  int port = freePort();
+  CountingListener listener(port);
+  int fd = raw::connectTo("127.0.0.1", static_cast<std::uint16_t>(port));
+  EXPECT_TRUE(waitFor([&] { return listener.calls.load() == 1; }));
+  sockets.clear();
+  raw::closeFd(fd);
 }
 
 }  // namespace
