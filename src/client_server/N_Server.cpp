@@ -123,11 +123,15 @@ void N_Server::acceptData(const N_Limits& limits) {
       N_Listener::rejectConnect(data);
       continue;
     }
-    N_Client** slot = m_pClients->append();
     try {
-      *slot = allocateClient(data);
+      N_Client** slot = m_pClients->append();
+      try {
+        *slot = allocateClient(data);
+      } catch (...) {
+        m_pClients->remove(slot);
+        throw;
+      }
     } catch (...) {
-      m_pClients->remove(slot);
       if (!limits.bContainFailures) throw;
       // Still queued if the client never took it over.
       N_Listener::rejectConnect(data);
@@ -143,12 +147,16 @@ void N_Server::acceptControl(const N_Limits& limits) {
       m_pControlListener->rejectConnect(data);
       continue;
     }
-    PendingControl* slot = m_pPendingControlSockets->append();
-    slot->age.reset();
     try {
-      slot->pSocket = Q_New<N_Socket>(data);
+      PendingControl* slot = m_pPendingControlSockets->append();
+      slot->age.reset();
+      try {
+        slot->pSocket = Q_New<N_Socket>(data);
+      } catch (...) {
+        m_pPendingControlSockets->remove(slot);
+        throw;
+      }
     } catch (...) {
-      m_pPendingControlSockets->remove(slot);
       if (!limits.bContainFailures) throw;
       m_pControlListener->rejectConnect(data);
     }

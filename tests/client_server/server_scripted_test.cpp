@@ -6,6 +6,8 @@
 #include "cs_fixture.h"
 #include "fault_guard.h"
 #include "free_port.h"
+#include "limits_guard.h"
+#include "winsock.h"
 #include "raw_socket.h"
 
 using namespace cs_test;
@@ -364,6 +366,183 @@ TEST_F(ServerScriptedTest, AFailedAcceptLeavesNoEntryAndIsRetried) {
   N_Client* client = nullptr;
   ASSERT_TRUE(pairUp(pump, a, client));
   EXPECT_EQ(1, N_ServerTestAccess::clientCount(server));
+}
+
+// The server under N_Limits. Heartbeats are off: the scripted ends don't
+// answer them.
+class ServerLimitsTest : public ServerScriptedTest {
+ protected:
+  void SetUp() override {
+    ServerScriptedTest::SetUp();
+    N_Client::setHeartbeatFrequency(0.0f);
+  }
+  static N_Limits limits() { return N_Limits::openNetwork(); }
+  static unsigned count(const std::vector<Received>& got, std::uint32_t type) {
+    return static_cast<unsigned>(std::count_if(got.begin(), got.end(), [&](const Received& r) { return r.type == type; }));
+  }
+};
+
+TEST_F(ServerLimitsTest, UnpairedConnectionsAreBoundedAndReleased) {
+  for (bool perAddress : {true, false}) {
+    SCOPED_TRACE(perAddress ? "per address" : "in all");
+    N_Limits l = limits();
+    l.fPairingTimeout = 0.5f;
+    l.uMaximumUnpaired = perAddress ? 10 : 2;
+    l.uMaximumUnpairedPerAddress = perAddress ? 2 : 0;
+    LimitsGuard guard(l);
+    N_Server server(port());
+    ServerPump pump{server};
+    // Pairing goes by address, so all three here are data connections.
+    ScriptedClient a(loopback(), port(), true, false);
+    ASSERT_TRUE(waitFor([&] { return N_ServerTestAccess::clientCount(server) == 1; }, 5000, pump));
+    ScriptedClient b(loopback(), port(), true, false);
+    ASSERT_TRUE(waitFor([&] { return N_ServerTestAccess::clientCount(server) == 2; }, 5000, pump));
+    // The third is closed on arrival; the two others go at their time limit.
+    ScriptedClient c(loopback(), port(), true, false);
+    EXPECT_TRUE(waitFor([&] { return c.data()->isConnected(); }, 5000, pump));
+    EXPECT_TRUE(waitFor([&] { return !c.data()->isConnected(); }, 5000, pump));
+    EXPECT_EQ(2, N_ServerTestAccess::clientCount(server));
+    EXPECT_TRUE(waitFor([&] { return N_ServerTestAccess::clientCount(server) == 0; }, 5000, pump));
+    EXPECT_TRUE(waitFor([&] { return !a.data()->isConnected() && !b.data()->isConnected(); }, 5000, pump));
+    // A control connection without a client goes the same way.
+    ScriptedClient d(loopback(), port(), false, true);
+    ASSERT_TRUE(waitFor([&] { return N_ServerTestAccess::pendingControlCount(server) == 1; }, 5000, pump));
+    EXPECT_TRUE(waitFor([&] { return N_ServerTestAccess::pendingControlCount(server) == 0; }, 5000, pump));
+    EXPECT_TRUE(waitFor([&] { return !d.control()->isConnected(); }, 5000, pump));
+  }
+  // One whose peer closed goes at once, long before its time limit.
+  N_Limits l = limits();
+  l.fPairingTimeout = 60.0f;
+  LimitsGuard guard(l);
+  N_Server server(port());
+  ServerPump pump{server};
+  auto d = std::make_unique<ScriptedClient>(loopback(), port(), true, false);
+  ASSERT_TRUE(waitFor([&] { return N_ServerTestAccess::clientCount(server) == 1; }, 5000, pump));
+  d.reset();
+  EXPECT_TRUE(waitFor([&] { return N_ServerTestAccess::clientCount(server) == 0; }, 5000, pump));
+}
+
+// A budget of control messages per client and update, and the requests of
+// one update divided once, with grants only where they changed or were
+// asked for.
+TEST_F(ServerLimitsTest, ControlWorkIsBudgetedAndRequestsCollected) {
+  LimitsGuard guard(limits());
+  N_Server server(port());
+  ServerPump pump{server};
+  ScriptedClient a(loopback(), port()), b(loopback(), port(), false, false);
+  N_Client* ca = nullptr;
+  N_Client* cb = nullptr;
+  ASSERT_TRUE(pairUp(pump, a, ca));
+  b.openData();
+  b.openControl();
+  ASSERT_TRUE(pairUp(pump, b, cb));
+  // Both grants settle first.
+  b.send(CM::CONTROL_BANDWIDTH_REQUEST, 10240);
+  EXPECT_EQ(10240u, lastGrant(b, pump));
+  a.drain(200, pump);
+  const Pump none;
+  for (int i = 0; i < 100; ++i) a.send(CM::CONTROL_ECHO);
+  for (std::uint32_t rate = 5000; rate < 5005; ++rate) a.send(CM::CONTROL_BANDWIDTH_REQUEST, rate);
+  N_Socket* control = Access::controlSocket(*ca);
+  ASSERT_TRUE(waitFor([&] { return control->getQueuedReceiveBytes() == 100 * 4 + 5 * 8; }, 5000));
+  server.update();
+  std::vector<Received> got = a.drain(300, none);
+  EXPECT_EQ(64u, count(got, CM::CONTROL_ECHO_REPLY));
+  EXPECT_EQ(0u, count(got, CM::CONTROL_BANDWIDTH_GRANT));
+  server.update();
+  got = a.drain(300, none);
+  EXPECT_EQ(36u, count(got, CM::CONTROL_ECHO_REPLY));
+  ASSERT_EQ(1u, count(got, CM::CONTROL_BANDWIDTH_GRANT));
+  EXPECT_EQ(5004u, got.back().value);
+  EXPECT_EQ(5004u, ca->getBandwidth());
+  EXPECT_TRUE(b.drain(200, pump).empty()) << "b's grant didn't change";
+}
+
+TEST_F(ServerLimitsTest, AClientThatDoesNotReadIsDisconnected) {
+  N_Limits l = limits();
+  l.uReceiveBacklog = 64 << 10;  // the scripted end in this process stops reading
+  l.fSendBacklogSeconds = 0.5f;
+  LimitsGuard guard(l);
+  N_Server server(port());
+  ServerPump pump{server};
+  ScriptedClient a(loopback(), port());
+  N_Client* client = nullptr;
+  ASSERT_TRUE(pairUp(pump, a, client));
+  std::vector<unsigned char> block(64 << 10, 7);
+  N_Socket* out = Access::tcpSocket(*client);
+  // Far more than half a second of 1250000 bytes per second plus what the
+  // system buffers hold.
+  for (int i = 0; i < 64; ++i) out->send(block.data(), static_cast<unsigned>(block.size()));
+  EXPECT_TRUE(waitFor([&] { return !client->isConnected(); }, 5000, pump));
+  const N_Socket* reported = nullptr;
+  bool tcpReported = false;
+  while (N_Socket::pollDisconnect(reported)) tcpReported |= reported == out;
+  EXPECT_TRUE(tcpReported);
+}
+
+// An accept that failed for lack of descriptors never becomes a client and
+// costs no update an exception, by default too; the connection is taken
+// once accepts work again.
+TEST_F(ServerLimitsTest, AFailedAcceptNeverBecomesAClient) {
+  N_Server server(port());
+  ServerPump pump{server};
+  FaultGuard faults(platform::fault::Call::WSAAccept, {1, true, platform::WSAEMFILE});
+  ScriptedClient a(loopback(), port(), true, false);
+  EXPECT_NO_THROW(pumpFor(600, pump));
+  EXPECT_GE(platform::fault::fired(platform::fault::Call::WSAAccept), 1);
+  EXPECT_EQ(0, N_ServerTestAccess::clientCount(server));
+  platform::fault::disarm(platform::fault::Call::WSAAccept);
+  a.openControl();
+  N_Client* client = nullptr;
+  ASSERT_TRUE(pairUp(pump, a, client));
+}
+
+// With failures contained a connection that can't be made into a client is
+// refused, and the update goes on.
+TEST_F(ServerLimitsTest, AClientThatCantBeMadeIsRefused) {
+  LimitsGuard guard(limits());
+  N_Server server(port());
+  ServerPump pump{server};
+  ScriptedClient a(loopback(), port(), true, false);
+  N_Listener& listener = server;
+  N_Socket::ConnectData* waiting = nullptr;
+  ASSERT_TRUE(waitFor([&] { return listener.pollConnect(waiting); }, 5000));
+  int refused = 0;
+  for (int nth = 1; nth <= 3; ++nth) {
+    ScriptedClient b(loopback(), port(), true, false);
+    ASSERT_TRUE(waitFor([&] { return b.data()->isConnected(); }, 5000));
+    FaultGuard faults;
+    faults.failAllocation(nth);
+    EXPECT_NO_THROW(server.update()) << nth;
+    refused += platform::fault::allocationsFailed();
+  }
+  countRefusedAllocations(refused);
+  EXPECT_TRUE(waitFor([&] { return !a.data()->isConnected(); }, 5000, pump));
+  EXPECT_EQ(0, N_ServerTestAccess::clientCount(server));
+}
+
+TEST_F(ServerLimitsTest, DisconnectClientNeverThrows) {
+  N_Server server(port());
+  ServerPump pump{server};
+  ScriptedClient a(loopback(), port()), b(loopback(), port(), false, false);
+  N_Client* ca = nullptr;
+  N_Client* cb = nullptr;
+  ASSERT_TRUE(pairUp(pump, a, ca));
+  b.openData();
+  b.openControl();
+  ASSERT_TRUE(pairUp(pump, b, cb));
+  a.drain(200, pump);
+  b.drain(200, pump);
+  {
+    FaultGuard faults;
+    faults.failAllocation(1, true);
+    EXPECT_NO_THROW(server.disconnectClient(ca));
+    countRefusedAllocations(platform::fault::allocationsFailed());
+  }
+  pump.forget(ca);
+  EXPECT_EQ(1, N_ServerTestAccess::clientCount(server));
+  // The grant that couldn't go then goes with the next update.
+  EXPECT_EQ(10240u, lastGrant(b, pump));
 }
 
 }  // namespace
