@@ -14,6 +14,7 @@
 #include <cstring>
 #include <string>
 
+#include "N_Initializer.h"
 #include "demo.h"
 
 namespace {
@@ -67,6 +68,10 @@ int main(int argc, char** argv) {
     }
   }
   demo::installStopHandler();
+  // Every process of the demo faces its peers as a server on the open
+  // network would: bounded queues, time limits for unpaired connections,
+  // bounded control work (see "Running a server on an open network").
+  N_Initializer::setLimits(N_Limits::openNetwork());
   if (options.mode == "resolve") return demo::runResolve(options);
   if (options.mode == "transport") return demo::runTransport(options);
   if (options.mode == "world") return demo::runWorld(options);
