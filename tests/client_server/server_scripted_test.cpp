@@ -386,10 +386,10 @@ TEST_F(ServerLimitsTest, UnpairedConnectionsAreBoundedAndReleased) {
   for (bool perAddress : {true, false}) {
     SCOPED_TRACE(perAddress ? "per address" : "in all");
     N_Limits l = limits();
-    l.fPairingTimeout = 0.5f;
+    l.fPairingTimeout = 600.0f;
     l.uMaximumUnpaired = perAddress ? 10 : 2;
     l.uMaximumUnpairedPerAddress = perAddress ? 2 : 0;
-    LimitsGuard guard(l);
+    auto bounded = std::make_unique<LimitsGuard>(l);
     N_Server server(port());
     ServerPump pump{server};
     // Pairing goes by address, so all three here are data connections.
@@ -397,28 +397,32 @@ TEST_F(ServerLimitsTest, UnpairedConnectionsAreBoundedAndReleased) {
     ASSERT_TRUE(waitFor([&] { return N_ServerTestAccess::clientCount(server) == 1; }, 5000, pump));
     ScriptedClient b(loopback(), port(), true, false);
     ASSERT_TRUE(waitFor([&] { return N_ServerTestAccess::clientCount(server) == 2; }, 5000, pump));
-    // The third is closed on arrival; the two others go at their time limit.
+    // The third is closed on arrival.
     ScriptedClient c(loopback(), port(), true, false);
     EXPECT_TRUE(waitFor([&] { return c.data()->isConnected(); }, 5000, pump));
     EXPECT_TRUE(waitFor([&] { return !c.data()->isConnected(); }, 5000, pump));
     EXPECT_EQ(2, N_ServerTestAccess::clientCount(server));
+    // With a short time limit the two others go, and so does a control
+    // connection without a client.
+    bounded.reset();
+    l.fPairingTimeout = 0.2f;
+    LimitsGuard brief(l);
     EXPECT_TRUE(waitFor([&] { return N_ServerTestAccess::clientCount(server) == 0; }, 5000, pump));
     EXPECT_TRUE(waitFor([&] { return !a.data()->isConnected() && !b.data()->isConnected(); }, 5000, pump));
-    // A control connection without a client goes the same way.
-    ScriptedClient d(loopback(), port(), false, true);
+    ScriptedClient e(loopback(), port(), false, true);
     ASSERT_TRUE(waitFor([&] { return N_ServerTestAccess::pendingControlCount(server) == 1; }, 5000, pump));
     EXPECT_TRUE(waitFor([&] { return N_ServerTestAccess::pendingControlCount(server) == 0; }, 5000, pump));
-    EXPECT_TRUE(waitFor([&] { return !d.control()->isConnected(); }, 5000, pump));
+    EXPECT_TRUE(waitFor([&] { return !e.control()->isConnected(); }, 5000, pump));
   }
   // One whose peer closed goes at once, long before its time limit.
   N_Limits l = limits();
-  l.fPairingTimeout = 60.0f;
+  l.fPairingTimeout = 600.0f;
   LimitsGuard guard(l);
   N_Server server(port());
   ServerPump pump{server};
-  auto d = std::make_unique<ScriptedClient>(loopback(), port(), true, false);
+  auto f = std::make_unique<ScriptedClient>(loopback(), port(), true, false);
   ASSERT_TRUE(waitFor([&] { return N_ServerTestAccess::clientCount(server) == 1; }, 5000, pump));
-  d.reset();
+  f.reset();
   EXPECT_TRUE(waitFor([&] { return N_ServerTestAccess::clientCount(server) == 0; }, 5000, pump));
 }
 
@@ -446,11 +450,15 @@ TEST_F(ServerLimitsTest, ControlWorkIsBudgetedAndRequestsCollected) {
   N_Socket* control = Access::controlSocket(*ca);
   ASSERT_TRUE(waitFor([&] { return control->getQueuedReceiveBytes() == 100 * 4 + 5 * 8; }, 5000));
   server.update();
-  std::vector<Received> got = a.drain(300, none);
+  // The budget left the rest, the requests included, for the next update.
+  EXPECT_EQ(36u * 4 + 5 * 8, control->getQueuedReceiveBytes());
+  ASSERT_TRUE(waitFor([&] { return a.control()->getQueuedReceiveBytes() == 64 * 4; }, 5000));
+  std::vector<Received> got = a.drain(100, none);
   EXPECT_EQ(64u, count(got, CM::CONTROL_ECHO_REPLY));
-  EXPECT_EQ(0u, count(got, CM::CONTROL_BANDWIDTH_GRANT));
   server.update();
-  got = a.drain(300, none);
+  EXPECT_EQ(0u, control->getQueuedReceiveBytes());
+  ASSERT_TRUE(waitFor([&] { return a.control()->getQueuedReceiveBytes() == 36 * 4 + 8; }, 5000));
+  got = a.drain(100, none);
   EXPECT_EQ(36u, count(got, CM::CONTROL_ECHO_REPLY));
   ASSERT_EQ(1u, count(got, CM::CONTROL_BANDWIDTH_GRANT));
   EXPECT_EQ(5004u, got.back().value);
