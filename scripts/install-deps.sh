@@ -5,7 +5,9 @@ set -euo pipefail
 
 # cmake/ninja/g++ build the library; clang with clang's runtime
 # (libclang_rt.fuzzer and the sanitizer runtimes) builds the fuzz targets;
-# GoogleTest/GoogleMock the tests; Google Benchmark the benchmark program.
+# GoogleTest/GoogleMock the tests; Google Benchmark the benchmark program;
+# tshark runs the Wireshark dissector over captured test traffic, doxygen
+# makes the API reference, dpkg-dev checks the Debian packages.
 PACKAGES=(
   cmake
   ninja-build
@@ -16,6 +18,9 @@ PACKAGES=(
   libgmock-dev
   libbenchmark-dev
   pkg-config
+  tshark
+  doxygen
+  dpkg-dev
 )
 
 installed() {
