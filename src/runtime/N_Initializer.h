@@ -1,38 +1,48 @@
-// The process-wide network runtime.
-//
-// Construct one N_Initializer before using any other class of the library and
-// keep it for as long as the network is used:
-//
-//   int main() {
-//     N_Initializer network;   // throws N_NetException* / Q_MemoryException*
-//     ...
-//   }
-//
-// The first instance brings the network up: the registries and queues, the
-// global mutex and the release event, Winsock, a TCP and a UDP provider, the
-// network thread, and the local address (N_Address::getLocalAddress()). Later
-// instances only raise a count. When the last instance goes, the network
-// thread is stopped and every socket, listener and address still registered is
-// deleted, oldest first: sockets, then listeners, then addresses. Pointers the
-// application still holds to them dangle afterwards, and they must have come
-// from new. A runtime that went down can be started again; the start is then
-// done anew, with a new network thread.
-//
-// The constructor returns only once the network thread runs and the local
-// address has its identifier; the destructor returns once that thread has
-// left its loop. Neither waits for anything else of the network. (A network
-// thread that the system refused to start leaves a runtime without I/O, and
-// a stop that doesn't wait for it.)
-//
-// A failed start (any exception from the first constructor) is not undone: the
-// count stays raised, so every later N_Initializer of the process is a no-op
-// and the runtime stays as far as it got. The local address is waited for at
-// most 10 seconds; a host name that doesn't resolve by then (or whose lookup
-// failed) ends the start with N_NetException_IPNotResolved, with the network
-// thread running.
-//
-// Constructors and destructors of N_Initializer must not run at the same time
-// on different threads.
+/// @class N_Initializer
+/// The process-wide network runtime.
+///
+/// Construct one N_Initializer before using any other class of the library and
+/// keep it for as long as the network is used:
+///
+/// @code
+///   int main() {
+///     N_Initializer network;   // throws N_NetException* / Q_MemoryException*
+///     ...
+///   }
+/// @endcode
+///
+/// The first instance brings the network up: the registries and queues, the
+/// global mutex and the release event, Winsock, a TCP and a UDP provider, the
+/// network thread, and the local address (N_Address::getLocalAddress()). Later
+/// instances only raise a count. When the last instance goes, the network
+/// thread is stopped and every socket, listener and address still registered is
+/// deleted, oldest first: sockets, then listeners, then addresses. A runtime
+/// that went down can be started again; the start is then done anew, with a
+/// new network thread.
+///
+/// @warning Pointers the application still holds to those objects dangle after
+/// the stop, and they must have come from new. Declare the N_Initializer
+/// before every other object of the library in the same scope, so that it goes
+/// last: a server, client, socket or address on the stack that outlives it is
+/// deleted by the stop and then destroyed a second time.
+///
+/// The constructor returns only once the network thread runs and the local
+/// address has its identifier; the destructor returns once that thread has
+/// left its loop. Neither waits for anything else of the network. (A network
+/// thread that the system refused to start leaves a runtime without I/O, and
+/// a stop that doesn't wait for it.)
+///
+/// A failed start (any exception from the first constructor) is not undone: the
+/// count stays raised, so every later N_Initializer of the process is a no-op
+/// and the runtime stays as far as it got. The local address is waited for at
+/// most 10 seconds; a host name that doesn't resolve by then (or whose lookup
+/// failed) ends the start with N_NetException_IPNotResolved, with the network
+/// thread running.
+///
+/// @par Threads
+/// Constructors and destructors of N_Initializer must not run at the same time
+/// on different threads. setLimits() and getLimits() may be called from any
+/// thread.
 #pragma once
 
 #include <atomic>
@@ -49,27 +59,48 @@ class N_Listener;
 
 class VARDEL_API N_Initializer {
  public:
+  /// The state of the network thread, as the runtime's start and stop see it.
   enum ThreadState : std::int32_t {
-    THREAD_RUNNING = 0,
-    THREAD_STOPPING = 1,
-    THREAD_STOPPED = 2,
+    THREAD_RUNNING = 0,   ///< In its loop.
+    THREAD_STOPPING = 1,  ///< Asked to leave its loop.
+    THREAD_STOPPED = 2,   ///< Not running.
   };
 
+  /// The first instance starts the runtime (see the class); later ones only
+  /// count. Blocks until the network thread runs and the local address has
+  /// its identifier: up to 10 seconds for a host name that doesn't resolve.
+  /// @throws N_NetException* if the network can't be brought up: one of
+  ///   N_NetException_Unavailable*, N_NetException_NotSupported*,
+  ///   N_NetException_ProcessLimit* and N_NetException_VersionFailure* if
+  ///   Winsock can't be started, N_NetException_NoTCP* or
+  ///   N_NetException_NoUDP* if a provider is missing, and
+  ///   N_NetException_IPNotResolved* if the local host has no address.
+  /// @throws Q_MemoryException_Allocation* if memory runs out.
+  ///
+  /// A failed start is not undone (see the class).
   N_Initializer();
+  /// The last instance stops the runtime and deletes every socket, listener
+  /// and address still registered; it blocks until the network thread has
+  /// left its loop.
   ~N_Initializer();
 
-  // A copy would be an instance that the count never saw.
+  /// A copy would be an instance that the count never saw.
   N_Initializer(const N_Initializer&) = delete;
-  // Copies the Winsock start data only.
+  /// Copies the Winsock start data only.
   N_Initializer& operator=(const N_Initializer& other);
 
-  // Body of the network thread. The parameter isn't read; returns 0.
+  /// Body of the network thread, which the runtime starts itself; not for
+  /// applications to call. The parameter isn't read; returns 0.
   static unsigned int threadNetwork(void* parameter);
 
-  // The process-wide protections (N_Limits.h). May be called at any time,
-  // before the first instance too; what runs picks the values up at its next
-  // step.
+  /// Sets the process-wide protections (N_Limits). May be called at any time
+  /// and from any thread, before the first instance too; what runs picks the
+  /// values up at its next step. A uMaximumMessageSize of 0 or above
+  /// 0x7FFFFFFB is taken as 0x7FFFFFFB.
+  /// @note The defaults suit a trusted network only: a server on the open one
+  /// should call `setLimits(N_Limits::openNetwork())` before it starts.
   static void setLimits(const N_Limits& limits);
+  /// The protections in force; N_Limits::defaults() until setLimits().
   static N_Limits getLimits();
 
  private:

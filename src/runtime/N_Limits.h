@@ -1,87 +1,111 @@
-// Bounds for a process that faces peers it can't trust.
-//
-// By default the library does what its classes' headers describe: connections
-// that were accepted but never paired wait for ever, queues have no bound, an
-// N_Server serves every waiting control message in one update() and answers
-// every bandwidth request with a grant to every client. That is right on a
-// trusted network and wrong on the open one, where port scanners, broken
-// clients and attackers come on day one. One call, before or while the
-// runtime runs, turns on every protection with values that suit a real-time
-// server:
-//
-//   N_Initializer::setLimits(N_Limits::openNetwork());
-//
-// Each value can be changed on its own afterwards:
-//
-//   N_Limits limits = N_Limits::openNetwork();
-//   limits.uMaximumMessageSize = 8 << 20;   // this application sends big maps
-//   N_Initializer::setLimits(limits);
-//
-// The settings are process-wide and read where they apply: by the network
-// thread at its next pass, by N_Server at its next update(). A value of 0
-// switches that protection off. Even by default, two choices are the safe
-// ones: the largest message a receiver takes is 64 MiB, and a listener whose
-// accept failed for lack of descriptors or memory rests a quarter of a
-// second instead of retrying at once.
+/// @struct N_Limits
+/// Bounds for a process that faces peers it can't trust.
+///
+/// By default the library does what its classes' headers describe: connections
+/// that were accepted but never paired wait for ever, queues have no bound, an
+/// N_Server serves every waiting control message in one update() and answers
+/// every bandwidth request with a grant to every client. That is right on a
+/// trusted network and wrong on the open one, where port scanners, broken
+/// clients and attackers come on day one. One call, before or while the
+/// runtime runs, turns on every protection with values that suit a real-time
+/// server:
+///
+/// @code
+///   N_Initializer::setLimits(N_Limits::openNetwork());
+/// @endcode
+///
+/// Each value can be changed on its own afterwards:
+///
+/// @code
+///   N_Limits limits = N_Limits::openNetwork();
+///   limits.uMaximumMessageSize = 8 << 20;   // this application sends big maps
+///   N_Initializer::setLimits(limits);
+/// @endcode
+///
+/// The settings are process-wide and read where they apply: by the network
+/// thread at its next pass, by N_Server at its next update(). A value of 0
+/// switches that protection off. Even by default, two choices are the safe
+/// ones: the largest message a receiver takes is 64 MiB, and a listener whose
+/// accept failed for lack of descriptors or memory rests a quarter of a
+/// second instead of retrying at once.
 #pragma once
 
 #include "vardel_export.h"
 
 struct VARDEL_API N_Limits {
-  // --- accepting -----------------------------------------------------------
-  // Listeners take their places in the network thread's wait set before the
-  // sockets do, so that no number of connections keeps new ones out.
+  /// @name Accepting
+  /// @{
+
+  /// Listeners take their places in the network thread's wait set before the
+  /// sockets do, so that no number of connections keeps new ones out.
   bool bListenersFirst;
-  // Seconds that a listener is left out of the wait set after an accept
-  // failed for lack of descriptors or memory (the connection stays in the
-  // system's backlog and is accepted once there is room again).
+  /// Seconds that a listener is left out of the wait set after an accept
+  /// failed for lack of descriptors or memory (the connection stays in the
+  /// system's backlog and is accepted once there is room again).
   float fAcceptBackoff;
-  // Seconds that N_Server keeps an accepted data connection without its
-  // control connection, or a control connection without its client, before
-  // it closes and frees it. Connections whose peer closed them before they
-  // were paired are freed at the next update() whatever this says.
+  /// Seconds that N_Server keeps an accepted data connection without its
+  /// control connection, or a control connection without its client, before
+  /// it closes and frees it. With a time limit set, connections whose peer
+  /// closed them before they were paired are also freed at the next update(),
+  /// however young.
   float fPairingTimeout;
-  // Connections waiting to be paired (data connections without control and
-  // control connections without client) that N_Server keeps, in all and from
-  // one IPv4 address; a connection beyond either is closed on arrival.
+  /// Connections waiting to be paired (data connections without control and
+  /// control connections without client) that N_Server keeps in all; a
+  /// connection beyond it is closed on arrival.
   unsigned uMaximumUnpaired;
+  /// As uMaximumUnpaired, for the connections from one IPv4 address.
   unsigned uMaximumUnpairedPerAddress;
-  // N_Server::update() refuses a connection that it can't make a client or
-  // a control socket of (memory or descriptors ran out, allocateClient
-  // threw) and goes on with the rest of its pass, instead of letting the
-  // exception out before the heartbeats of the clients it already has.
+  /// N_Server::update() refuses a connection that it can't make a client or
+  /// a control socket of (memory or descriptors ran out, allocateClient
+  /// threw) and goes on with the rest of its pass, instead of letting the
+  /// exception out before the heartbeats of the clients it already has.
   bool bContainFailures;
+  /// @}
 
-  // --- memory per peer -----------------------------------------------------
-  // The largest message a packaged socket takes; a length above it ends the
-  // connection as a broken stream does. At most 0x7FFFFFFB.
+  /// @name Memory per peer
+  /// @{
+
+  /// The largest message a packaged socket takes; a length above it ends the
+  /// connection as a broken stream does. At most 0x7FFFFFFB. It is the
+  /// receiver's bound: a peer that sends bigger messages loses its connection.
   unsigned uMaximumMessageSize;
-  // Short messages are copied out of the 64 KiB read buffer instead of
-  // keeping it, and the block of a long message grows with the bytes that
-  // actually arrived instead of being allocated at the length the prefix
-  // claims.
+  /// Short messages are copied out of the 64 KiB read buffer instead of
+  /// keeping it, and the block of a long message grows with the bytes that
+  /// actually arrived instead of being allocated at the length the prefix
+  /// claims.
   bool bCompactMessages;
-  // Bytes of received messages not yet polled at which a socket stops
-  // reading; the system's buffers then fill and TCP slows the peer down.
-  // Reading resumes once poll() brought the backlog below the bound.
+  /// Bytes of received messages not yet polled at which a socket stops
+  /// reading; the system's buffers then fill and TCP slows the peer down.
+  /// Reading resumes once poll() brought the backlog below the bound.
   unsigned uReceiveBacklog;
-  // N_Server disconnects a client (all three channels, as the heartbeat
-  // does) when one of its sockets holds more unsent bytes than this many
-  // seconds of its bandwidth, but never for fewer than uMinimumSendBacklog.
+  /// N_Server disconnects a client (all three channels, as the heartbeat
+  /// does) when one of its sockets holds more unsent bytes than this many
+  /// seconds of its bandwidth, but never for fewer than uMinimumSendBacklog.
   float fSendBacklogSeconds;
+  /// The unsent bytes below which fSendBacklogSeconds never disconnects.
   unsigned uMinimumSendBacklog;
+  /// @}
 
-  // --- the work of one N_Server::update() ----------------------------------
-  // Control messages served per client and update; the rest wait for the
-  // next update().
+  /// @name The work of one N_Server::update()
+  /// @{
+
+  /// Control messages served per client and update; the rest wait for the
+  /// next update().
   unsigned uControlBudget;
-  // Bandwidth requests are collected and the budget divided once per
-  // update(), and grants go only to the clients whose grant changed or that
-  // asked.
+  /// Bandwidth requests are collected and the budget divided once per
+  /// update(), and grants go only to the clients whose grant changed or that
+  /// asked.
   bool bCoalesceBandwidth;
+  /// @}
 
-  // What a process has until it calls N_Initializer::setLimits.
+  /// What a process has until it calls N_Initializer::setLimits: every
+  /// protection off, except uMaximumMessageSize (64 MiB) and fAcceptBackoff
+  /// (0.25 s).
   static N_Limits defaults();
-  // Every protection on, with the values documented in the README.
+  /// Every protection on, with the values documented in the README: listeners
+  /// first, 0.25 s accept rest, 5 s pairing limit, 32 unpaired connections (4
+  /// per address), contained failures, 1 MiB messages, compact messages, 1 MiB
+  /// receive backlog, 8 s (at least 256 KiB) send backlog, 64 control
+  /// messages per client and update, collected bandwidth requests.
   static N_Limits openNetwork();
 };
