@@ -1,0 +1,162 @@
+// One N_Server host for tests that watch the traffic from outside (a capture),
+// driven line by line.
+//
+//   vardel_host_server_peer --host 127.0.0.1 --port P [--hb-frequency F] [--hb-latency L]
+//
+// It makes its own runtime on --host, serves on data port P (and the fixed
+// control port) and calls update() in a loop of about a millisecond. It
+// prints, one per line:
+//   ready                          runtime up, server constructed
+//   client ADDRESS                 a client was paired
+//   recv N TEXT                    a message of N bytes from a client (TEXT: its first 24 bytes)
+//   done                           a command below finished
+//   bye                            at "quit" or the end of input
+// Commands on standard input:
+//   quit | maximum N               setMaximumBandwidthUsage(N)
+//   burst COUNT PREFIX             COUNT reliable messages "PREFIX<i>;" to every client, each
+//                                  flushed on its own while the network thread is held, so
+//                                  they all leave in one write (one TCP segment)
+#include <poll.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <memory>
+#include <sstream>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "N_Address.h"
+#include "N_Client.h"
+#include "N_Initializer.h"
+#include "N_Server.h"
+#include "Q_Exception.h"
+#include "vardel_platform.h"
+#include "win32.h"
+
+namespace {
+
+void say(const std::string& line) {
+  std::fputs(line.c_str(), stdout);
+  std::fputc('\n', stdout);
+  std::fflush(stdout);
+}
+
+// A line of standard input if one is complete; never blocks.
+bool readCommand(std::string& pending, std::string& line, bool& inputClosed) {
+  for (;;) {
+    std::size_t end = pending.find('\n');
+    if (end != std::string::npos) {
+      line = pending.substr(0, end);
+      pending.erase(0, end + 1);
+      return true;
+    }
+    if (inputClosed) return false;
+    pollfd p{0, POLLIN, 0};
+    if (::poll(&p, 1, 0) <= 0) return false;
+    char buffer[4096];
+    ssize_t got = ::read(0, buffer, sizeof buffer);
+    if (got <= 0) {
+      inputClosed = true;
+      return false;
+    }
+    pending.append(buffer, static_cast<std::size_t>(got));
+  }
+}
+
+void burst(const std::vector<N_Client*>& clients, int count, const std::string& prefix) {
+  // The runtime's mutex is a named one: holding it keeps the network thread
+  // from sending until every message is queued.
+  platform::HANDLE runtime = platform::CreateMutexA(nullptr, platform::FALSE, "Kelvane network mutex");
+  platform::WaitForSingleObject(runtime, platform::INFINITE);
+  for (N_Client* client : clients) {
+    for (int i = 0; i < count; ++i) {
+      std::string payload = prefix + std::to_string(i) + ";";
+      client->queueReliable(payload.data(), static_cast<unsigned>(payload.size()), 0, 1);
+      // The flush gate stays shut for bytes / bandwidth after each message.
+      const auto limit = std::chrono::steady_clock::now() + std::chrono::seconds(5);
+      while (client->getReliableBytesWaiting() > 0 && std::chrono::steady_clock::now() < limit)
+        client->flushReliable();
+    }
+  }
+  platform::ReleaseMutex(runtime);
+  platform::CloseHandle(runtime);
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  std::string host = "127.0.0.1";
+  int port = 3123;
+  for (int i = 1; i < argc; ++i) {
+    std::string a = argv[i];
+    auto next = [&]() -> const char* { return i + 1 < argc ? argv[++i] : ""; };
+    if (a == "--host") host = next();
+    else if (a == "--port") port = std::atoi(next());
+    else if (a == "--hb-frequency") N_Client::setHeartbeatFrequency(std::strtof(next(), nullptr));
+    else if (a == "--hb-latency") N_Client::setHeartbeatLatency(std::strtof(next(), nullptr));
+    else {
+      std::fprintf(stderr, "server_peer: unknown option %s\n", a.c_str());
+      return 2;
+    }
+  }
+
+  platform::setLocalHost(host.c_str());
+  try {
+    N_Initializer network;
+    N_Server server(port);
+    std::vector<N_Client*> clients;
+    say("ready");
+    std::string pending;
+    bool inputClosed = false;
+    for (;;) {
+      server.update();
+      N_Client* joined;
+      while (server.pollConnect(joined)) {
+        clients.push_back(joined);
+        say(std::string("client ") + const_cast<const char*>(joined->getAddress()->getStringNumber()));
+      }
+      for (N_Client* client : clients) {
+        void* message;
+        unsigned size;
+        while (client->poll(message, size))
+          say("recv " + std::to_string(size) + " " +
+              std::string(static_cast<const char*>(message), size < 24 ? size : 24));
+      }
+      std::string line;
+      while (readCommand(pending, line, inputClosed)) {
+        std::istringstream in(line);
+        std::string command;
+        in >> command;
+        if (command == "quit") {
+          inputClosed = true;
+          pending.clear();
+          break;
+        } else if (command == "maximum") {
+          unsigned value = 0;
+          in >> value;
+          server.setMaximumBandwidthUsage(value);
+          say("done");
+        } else if (command == "burst") {
+          int count = 0;
+          std::string prefix;
+          in >> count >> prefix;
+          burst(clients, count, prefix);
+          say("done");
+        } else if (!command.empty()) {
+          say("error unknown command " + command);
+        }
+      }
+      if (inputClosed && pending.empty()) break;
+      std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    }
+    for (N_Client* client : clients) server.disconnectClient(client);
+    say("bye");
+    return 0;
+  } catch (Q_Exception* e) {
+    say(std::string("error ") + e->getErrorMessage());
+    return 1;
+  }
+}
