@@ -1,5 +1,6 @@
 #include "N_Address.h"
 
+#include <atomic>
 #include <cstring>
 
 #include "N_Initializer.h"
@@ -14,6 +15,10 @@
 using namespace platform;
 
 namespace {
+
+// Resolver threads running now, against N_Limits::uMaximumLookups: a flood
+// of accepted connections must not become a flood of blocked threads.
+std::atomic<unsigned> g_uLookups{0};
 
 const char kAddressMutexName[] = "N_Address mutex";
 
@@ -101,10 +106,15 @@ void N_Address::construct(const char* text) {
     }
     // Without its mutex the block can't be shared safely; the address then
     // keeps what it was given, as if its lookup had failed.
-    if (m_pShared->hMutex != nullptr) {
+    // Past the limit of lookups under way it keeps what it was given the
+    // same way.
+    const unsigned maximumLookups = N_Initializer::getLimits().uMaximumLookups;
+    if (m_pShared->hMutex != nullptr && (maximumLookups == 0 || g_uLookups.load() < maximumLookups)) {
       ++m_pShared->iReferences;
+      ++g_uLookups;
       CWinThread* thread = AfxBeginThread(resolver, m_pShared, 0, 0, 0, nullptr);
       if (thread == nullptr) {
+        --g_uLookups;
         --m_pShared->iReferences;  // no resolver to drop it
       } else {
         // The resolver may be done already; it clears m_pThread under the
@@ -247,6 +257,7 @@ unsigned int N_Address::threadHostByName(void* parameter) {
   }
   dropReference(shared);
   Q_DeleteArray(name);
+  --g_uLookups;
   return 0;
 }
 
@@ -275,5 +286,6 @@ unsigned int N_Address::threadHostByAddr(void* parameter) {
     owner->m_pThread = nullptr;
   }
   dropReference(shared);
+  --g_uLookups;
   return 0;
 }

@@ -60,6 +60,11 @@ struct VARDEL_API N_Limits {
   /// threw) and goes on with the rest of its pass, instead of letting the
   /// exception out before the heartbeats of the clients it already has.
   bool bContainFailures;
+  /// Name lookups (N_Address resolver threads) under way at once, process-
+  /// wide. An address made beyond it keeps only what it was given (the
+  /// number of an accepted peer, without its name), as if its lookup had
+  /// failed, so that a connect flood can't become a flood of threads.
+  unsigned uMaximumLookups;
   /// @}
 
   /// @name Memory per peer

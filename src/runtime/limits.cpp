@@ -26,6 +26,7 @@ N_Limits N_Limits::defaults() {
   limits.uMaximumUnpaired = 0;
   limits.uMaximumUnpairedPerAddress = 0;
   limits.bContainFailures = false;
+  limits.uMaximumLookups = 0;
   limits.uMaximumMessageSize = 64u << 20;
   limits.bCompactMessages = false;
   limits.uReceiveBacklog = 0;
@@ -43,6 +44,7 @@ N_Limits N_Limits::openNetwork() {
   limits.uMaximumUnpaired = 32;
   limits.uMaximumUnpairedPerAddress = 4;
   limits.bContainFailures = true;
+  limits.uMaximumLookups = 16;
   limits.uMaximumMessageSize = 1u << 20;
   limits.bCompactMessages = true;
   limits.uReceiveBacklog = 1u << 20;

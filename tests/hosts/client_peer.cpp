@@ -23,17 +23,27 @@
 //   qrn KEY PRIO SIZE CHAR | qun ...       the same with SIZE copies of CHAR
 //   limits                                 prints "limits LARGEST_UNRELIABLE"
 //   fr | fu                                flush once
-//   send-r COUNT PREFIX [MS] | send-u COUNT PREFIX [MS]
+//   send-r COUNT PREFIX [MS [stamp]] | send-u COUNT PREFIX [MS [stamp]]
 //        queue COUNT payloads "PREFIX<i>;" (i from 0), each once the queue
 //        is empty again and at least MS milliseconds (default 0) after the
 //        one before, so each leaves in a message of its own; flushing every
-//        pass. Prints "sent COUNT" when the last is queued.
+//        pass. Prints "sent COUNT" when the last is queued. With "stamp" each
+//        is "PREFIX<i>@<NS>;", NS the steady clock in nanoseconds when queued
+//        (the same clock in every process of the machine).
 //   pump on|off                            flush both queues every pass
 //   echo on|off                            queue every message back, reliably
 //   read on|off                            poll and print messages
+//   probe MS | probe report | probe stop
+//        queue a numbered payload "#N;" every MS milliseconds, for a server
+//        that echoes them back; echoes are taken out of the read (not
+//        printed) and must come back in order. "report" prints
+//        "probe-window COUNT P99_MS MAX_MS" for the round trips since the
+//        last report; "stop" ends the sending and, once every echo is back
+//        (or after 10 s), prints "probe-final SENT ECHOED DISORDER".
 #include <poll.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
@@ -42,6 +52,7 @@
 #include <sstream>
 #include <string>
 #include <thread>
+#include <vector>
 
 #include "N_Address.h"
 #include "N_Client.h"
@@ -87,11 +98,65 @@ struct Sender {
   int count = 0;
   int next = 0;
   int spacingMs = 0;
+  bool stamp = false;
   std::string prefix;
   std::chrono::steady_clock::time_point last;
 };
 
 std::string errorText(Q_Exception* e) { return e->getErrorMessage(); }
+
+// Numbered payloads to an echoing server, and their round trips.
+struct Probe {
+  using Clock = std::chrono::steady_clock;
+  bool sending = false;
+  bool stopping = false;
+  int spacingMs = 20;
+  std::vector<Clock::time_point> sentAt;  // by number
+  std::size_t expected = 0;               // the number whose echo is due
+  std::size_t echoed = 0;
+  std::size_t disorder = 0;
+  std::vector<double> window;  // round trips (ms) since the last report
+  Clock::time_point last;
+  Clock::time_point stoppedAt;
+
+  // Takes the echoes out of a received batch; false if it holds none.
+  bool take(const std::string& text) {
+    if (text.empty() || text[0] != '#') return false;
+    const Clock::time_point now = Clock::now();
+    for (std::size_t at = 0, end; (end = text.find(';', at)) != std::string::npos; at = end + 1) {
+      const std::size_t n = std::strtoul(text.c_str() + at + 1, nullptr, 10);
+      disorder += n != expected;
+      if (n < sentAt.size()) window.push_back(std::chrono::duration<double, std::milli>(now - sentAt[n]).count());
+      expected = n + 1;
+      ++echoed;
+    }
+    return true;
+  }
+  // Queues the next payload when it is due; the final line once the
+  // stopping is over, else nothing.
+  std::string step(N_Client& client) {
+    const Clock::time_point now = Clock::now();
+    if (sending && now - last >= std::chrono::milliseconds(spacingMs)) {
+      std::string payload = "#" + std::to_string(sentAt.size()) + ";";
+      client.queueReliable(payload.data(), static_cast<unsigned>(payload.size()), 0, 1);
+      sentAt.push_back(now);
+      last = now;
+    }
+    if (!stopping || (echoed < sentAt.size() && now - stoppedAt < std::chrono::seconds(10))) return "";
+    stopping = false;
+    return "probe-final " + std::to_string(sentAt.size()) + " " + std::to_string(echoed) + " " +
+           std::to_string(disorder);
+  }
+  std::string report() {
+    std::sort(window.begin(), window.end());
+    const double p99 = window.empty() ? 0.0 : window[(window.size() * 99 + 99) / 100 - 1];
+    char text[96];
+    std::snprintf(text, sizeof text, "probe-window %zu %.3f %.3f", window.size(), p99,
+                  window.empty() ? 0.0 : window.back());
+    window.clear();
+    return text;
+  }
+};
 
 }  // namespace
 
@@ -145,6 +210,7 @@ int main(int argc, char** argv) {
     std::string pending;
     Sender senders[2];  // reliable, unreliable
     senders[1].reliable = false;
+    Probe probe;
 
     for (;;) {
       client->update();
@@ -229,6 +295,9 @@ int main(int argc, char** argv) {
             sender.next = 0;
             sender.spacingMs = 0;
             in >> sender.count >> sender.prefix >> sender.spacingMs;
+            std::string flag;
+            in >> flag;
+            sender.stamp = flag == "stamp";
           } else if (command == "pump") {
             std::string on;
             in >> on;
@@ -237,6 +306,19 @@ int main(int argc, char** argv) {
             std::string on;
             in >> on;
             echo = on == "on";
+          } else if (command == "probe") {
+            std::string what;
+            in >> what;
+            if (what == "report") {
+              say(probe.report());
+            } else if (what == "stop") {
+              probe.sending = false;
+              probe.stopping = true;
+              probe.stoppedAt = std::chrono::steady_clock::now();
+            } else {
+              probe.spacingMs = std::atoi(what.c_str());
+              probe.sending = true;
+            }
           } else if (command == "read") {
             std::string on;
             in >> on;
@@ -256,7 +338,12 @@ int main(int argc, char** argv) {
           if (sender.next < sender.count && waiting == 0 &&
               std::chrono::steady_clock::now() - sender.last >= std::chrono::milliseconds(sender.spacingMs)) {
             sender.last = std::chrono::steady_clock::now();
-            std::string payload = sender.prefix + std::to_string(sender.next) + ";";
+            std::string payload = sender.prefix + std::to_string(sender.next);
+            if (sender.stamp)
+              payload += "@" + std::to_string(std::chrono::duration_cast<std::chrono::nanoseconds>(
+                                                  sender.last.time_since_epoch())
+                                                  .count());
+            payload += ";";
             if (sender.reliable)
               client->queueReliable(payload.data(), static_cast<unsigned>(payload.size()), 0, 1);
             else
@@ -265,16 +352,18 @@ int main(int argc, char** argv) {
             if (sender.next == sender.count) say("sent " + std::to_string(sender.count));
           }
         }
+        if (std::string final = probe.step(*client); !final.empty()) say(final);
         if (read) {
           void* message = nullptr;
           unsigned size = 0;
           while (client->poll(message, size)) {
             std::string text(static_cast<const char*>(message), size);
+            if (probe.take(text)) continue;
             say("recv " + std::to_string(size) + " " + text);
             if (echo) client->queueReliable(text.data(), size, 0, 0);
           }
         }
-        if (pump || echo || senders[0].count > 0 || senders[1].count > 0) {
+        if (pump || echo || senders[0].count > 0 || senders[1].count > 0 || probe.sending || probe.stopping) {
           client->flushReliable();
           client->flushUnreliable();
         }
