@@ -4,6 +4,8 @@
 #include <string>
 #include <vector>
 
+#include "N_NetworkModel.h"
+
 namespace demo {
 
 struct Options {
@@ -15,8 +17,17 @@ struct Options {
   double seconds = 20.0;             // 0: run until interrupted
   float loss = 0.0f;                 // simulated loss of unreliable messages
   unsigned delayMin = 0, delayMax = 0;  // simulated read delay, milliseconds
+  std::string model;                 // the network model as given to --model ("" off)
+  N_NetworkModel network;            // ... and parsed
+  std::string simulateOn = "clients";  // world: clients | server | both
+  bool simulateHere = true;          // this process applies the settings above
+  std::string csv;                   // client: latency of every message read, to this file
   bool verbose = false;
 };
+
+// "delay=40,jitter=20,loss=0.05,dup=0.01,reorder=0.05:30,cap=20000,queue=65536,seed=7";
+// false on an unknown key.
+bool parseModel(const std::string& text, N_NetworkModel& model);
 
 int runResolve(const Options& options);
 int runTransport(const Options& options);

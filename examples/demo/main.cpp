@@ -2,6 +2,7 @@
 //
 //   vardel_demo                       shared world: a server and 4 client processes on loopback
 //   vardel_demo world   [--clients N] [--seconds S] [--loss F] [--delay MIN:MAX]
+//                       [--model K=V,...] [--simulate-on clients|server|both] [--csv FILE]
 //   vardel_demo server  [--port P] [--seconds S]        run the server by hand
 //   vardel_demo client  SERVER [--host ADDR] [--port P] run one client by hand
 //   vardel_demo transport [listen | connect HOST]       two processes, messages over TCP and UDP
@@ -22,7 +23,12 @@ namespace {
 void usage() {
   std::printf(
       "usage: vardel_demo [world|server|client SERVER|transport [listen|connect HOST]|resolve [NAME] [NUMBER]]\n"
-      "       options: --host ADDR --port P --clients N --seconds S (0: forever) --loss F --delay MIN:MAX -v\n");
+      "       options: --host ADDR --port P --clients N --seconds S (0: forever) --loss F --delay MIN:MAX -v\n"
+      "       --model delay=MS,jitter=MS,loss=F,dup=F,reorder=F:MS,cap=BYTES/S,queue=BYTES,seed=N\n"
+      "               the network model: a delay per message, no limit on the rate (see the README)\n"
+      "       --simulate-on clients|server|both  where the world applies --loss, --delay and --model\n"
+      "               (default clients: the server stays a healthy one)\n"
+      "       --csv FILE  client: every position read as \"seconds,latency_ms\"; world: of the first client\n");
 }
 
 }  // namespace
@@ -55,6 +61,20 @@ int main(int argc, char** argv) {
       options.delayMin = static_cast<unsigned>(std::strtoul(v, nullptr, 10));
       const char* colon = std::strchr(v, ':');
       options.delayMax = colon ? static_cast<unsigned>(std::strtoul(colon + 1, nullptr, 10)) : options.delayMin;
+    } else if (a == "--model") {
+      options.model = value();
+      if (!demo::parseModel(options.model, options.network)) {
+        std::fprintf(stderr, "vardel_demo: bad --model %s\n", options.model.c_str());
+        return 2;
+      }
+    } else if (a == "--simulate-on") {
+      options.simulateOn = value();
+      if (options.simulateOn != "clients" && options.simulateOn != "server" && options.simulateOn != "both") {
+        usage();
+        return 2;
+      }
+    } else if (a == "--csv") {
+      options.csv = value();
     } else if (a == "-v") {
       options.verbose = true;
     } else if (a == "-h" || a == "--help") {

@@ -2,12 +2,16 @@
 // of its own with its own address. Clients move an entity, send its position
 // unreliably 60 times a second (keyed, so a newer position replaces one that
 // hasn't left yet) and a status event reliably once a second. The server
-// relays every position to every client and shows a live table per client.
+// relays every position to every client and shows a live table per client,
+// with the latency and loss each direction achieved under the simulated bad
+// network (which by default only the clients apply, to what they read).
 #include <chrono>
 #include <cmath>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <map>
+#include <set>
 #include <string>
 #include <thread>
 #include <vector>
@@ -30,9 +34,12 @@ struct Record {
   enum : unsigned { POSITION = 1, STATUS = 2 };
   unsigned type;
   unsigned entity;
-  float x, y;
+  float x, y;       // STATUS: the client's mean latency (ms) and loss share of
+                    // what it read, over the last second and since the start
+                    // (NaN and negative: nothing measured yet)
   float worldTime;  // the sender's world clock when it queued the record
-  unsigned count;   // STATUS: positions the client has seen of other entities
+  unsigned count;   // POSITION: unreliable batches the sender had sent before
+                    // (gaps are losses); STATUS: positions the client has seen
 };
 static_assert(sizeof(Record) == 24, "records travel as they lie in memory");
 
@@ -41,6 +48,79 @@ constexpr double kTick = 1.0 / 60.0;
 void applySimulation(const Options& o) {
   N_Client::simulatePacketLoss(o.loss);
   N_Client::simulateLatency(o.delayMin, o.delayMax);
+  N_Client::simulateNetwork(o.network);
+}
+
+// Sends whatever the unreliable queue may and counts the batches that left:
+// every record queued since the last one that left carries that count.
+void flushCounted(N_Client& client, unsigned& sent) {
+  const unsigned before = client.getUnreliableBytesWaiting();
+  client.flushUnreliable();
+  if (before > 0 && client.getUnreliableBytesWaiting() < before) ++sent;
+}
+
+// Latency and loss of one direction as its reader sees them: the latency of
+// each record read against its sender's world clock (the two clocks are in
+// line), and the batch numbers that never arrived.
+struct Achieved {
+  double latencySum = 0;  // ms, this second
+  unsigned latencyCount = 0;
+  double latencyMs = NAN;  // mean of the last full second; NaN: nothing read
+  unsigned long long distinct = 0;
+  long long highest = -1;
+  std::set<unsigned> recent;  // batch numbers read lately, against copies
+
+  void read(unsigned batch, double latency) {
+    latencySum += latency;
+    ++latencyCount;
+    if (recent.insert(batch).second) ++distinct;
+    if (static_cast<long long>(batch) > highest) highest = batch;
+    while (!recent.empty() && *recent.begin() + 512 < static_cast<unsigned long long>(highest))
+      recent.erase(recent.begin());
+  }
+  void endSecond() {
+    latencyMs = latencyCount > 0 ? latencySum / latencyCount : NAN;
+    latencySum = 0;
+    latencyCount = 0;
+  }
+  double loss() const { return highest < 0 ? -1 : 1.0 - static_cast<double>(distinct) / (highest + 1); }
+};
+
+std::string percent(double share) {
+  if (share < 0) return "-";
+  char text[16];
+  std::snprintf(text, sizeof text, "%.1f%%", share * 100.0);
+  return text;
+}
+
+std::string millis(double ms) {
+  if (std::isnan(ms)) return "-";
+  char text[16];
+  std::snprintf(text, sizeof text, "%.1f", ms);
+  return text;
+}
+
+// What the settings say, for the dashboard.
+std::string describeSettings(const Options& o) {
+  std::string text;
+  char part[160];
+  if (o.loss > 0 || o.delayMin || o.delayMax) {
+    std::snprintf(part, sizeof part, "read gate: loss %.0f%%, %u-%u ms shut after every read", o.loss * 100.0,
+                  o.delayMin, o.delayMax);
+    text += part;
+  }
+  if (!o.model.empty()) {
+    const N_NetworkModel& m = o.network;
+    if (!text.empty()) text += "; ";
+    std::snprintf(part, sizeof part, "model: delay %.0f+-%.0f ms, loss %.1f%%, dup %.1f%%, reorder %.1f%% by %.0f ms",
+                  m.fDelay, m.fJitter, m.fLoss * 100.0, m.fDuplicate * 100.0, m.fReorder * 100.0, m.fReorderWindow);
+    text += part;
+    if (m.uBandwidth > 0) {
+      std::snprintf(part, sizeof part, ", cap %u B/s, queue %u B", m.uBandwidth, m.uQueueLimit);
+      text += part;
+    }
+  }
+  return text;
 }
 
 template <class Each>
@@ -62,25 +142,42 @@ struct ClientRow {
   bool haveOffset = false;
   unsigned seenByClient = 0;
   float x = 0, y = 0;
+  unsigned sentDown = 0;  // unreliable batches sent to the client
+  Achieved up;            // client to server, as read here
+  double downMs = NAN, downLoss = -1;  // server to client, as the client reported
 };
 
-void drawTable(N_Server& server, std::map<N_Client*, ClientRow>& rows, const Options& o, bool first) {
-  if (!first) std::printf("\x1b[%zuA", rows.size() + 5 + (rows.empty() ? 1 : 0));
-  std::printf("\x1b[Kvardel shared world  world time %8.2f s  clients %zu  simulated loss %.0f%%  delay %u-%u ms\n",
-              server.getWorldTimer().getAge(), rows.size(), o.loss * 100.0, o.delayMin, o.delayMax);
-  std::printf("\x1b[K%-12s %6s %9s %10s %10s %10s %9s %9s %14s\n", "client", "entity", "latency", "clock off",
-              "bandwidth", "rel wait", "unrel wait", "msgs/s", "position");
-  std::printf("\x1b[K%-12s %6s %9s %10s %10s %10s %9s %9s %14s\n", "", "", "ms", "ms", "B/s", "B", "B", "in", "");
-  std::printf("\x1b[K\n");
-  if (rows.empty()) std::printf("\x1b[K  (waiting for clients)\n");
+void drawTable(N_Server& server, std::map<N_Client*, ClientRow>& rows, const Options& o, int& lines) {
+  if (lines > 0) std::printf("\x1b[%dA", lines);
+  lines = 0;
+  auto line = [&lines](const char* format, auto... values) {
+    std::printf("\x1b[K");
+    std::printf(format, values...);
+    ++lines;
+  };
+  line("vardel shared world  world time %8.2f s  clients %zu\n", server.getWorldTimer().getAge(), rows.size());
+  const std::string settings = describeSettings(o);
+  const std::string where = o.mode == "world" ? "on " + o.simulateOn : "on this server";
+  if (settings.empty())
+    line("no simulated bad network\n");
+  else
+    line("simulated %s: %s\n", where.c_str(), settings.c_str());
+  line("achieved: up = client to server as the server reads it, down = server to client as the client reads it;\n");
+  line("          latency by the two world clocks, which differ by about the clock off column\n");
+  line("%-12s %6s %7s %9s %9s %8s %8s %6s %8s %7s %8s %7s %14s\n", "client", "entity", "rtt", "clock off",
+       "bandwidth", "rel wait", "unr wait", "in", "up", "up", "down", "down", "position");
+  line("%-12s %6s %7s %9s %9s %8s %8s %6s %8s %7s %8s %7s %14s\n", "", "", "ms", "ms", "B/s", "B", "B", "msg/s",
+       "ms", "loss", "ms", "loss", "");
+  if (rows.empty()) line("  (waiting for clients)\n");
   for (auto& [client, row] : rows) {
     char offset[16] = "-";
     if (row.haveOffset) std::snprintf(offset, sizeof offset, "%+.1f", row.offsetMs);
-    std::printf("\x1b[K%-12s %6u %9.1f %10s %10u %10u %9u %9.0f %6.1f,%6.1f\n", row.name.c_str(), row.entity,
-                client->getLatency() * 1000.0, offset, client->getBandwidth(), client->getReliableBytesWaiting(),
-                client->getUnreliableBytesWaiting(), row.rate, row.x, row.y);
+    line("%-12s %6u %7.1f %9s %9u %8u %8u %6.0f %8s %7s %8s %7s %6.1f,%6.1f\n", row.name.c_str(), row.entity,
+         client->getLatency() * 1000.0, offset, client->getBandwidth(), client->getReliableBytesWaiting(),
+         client->getUnreliableBytesWaiting(), row.rate, millis(row.up.latencyMs).c_str(),
+         percent(row.up.loss()).c_str(), millis(row.downMs).c_str(), percent(row.downLoss).c_str(), row.x, row.y);
   }
-  std::printf("\x1b[K\n");
+  line("\n");
   std::fflush(stdout);
 }
 
@@ -90,14 +187,14 @@ int runServer(const Options& options) {
   if (!options.host.empty()) platform::setLocalHost(options.host.c_str());
   try {
     N_Initializer network;
-    applySimulation(options);
+    if (options.simulateHere) applySimulation(options);
     N_Server server(options.port);
     std::map<N_Client*, ClientRow> rows;
     unsigned nextEntity = 1;
     auto start = Clock::now();
     auto nextDraw = start;
     auto nextSecond = start + std::chrono::seconds(1);
-    bool first = true;
+    int lines = 0;
     while (!stopRequested()) {
       auto tick = Clock::now();
       if (options.seconds > 0 && tick - start > std::chrono::duration<double>(options.seconds)) break;
@@ -126,11 +223,14 @@ int runServer(const Options& options) {
             if (r.type == Record::POSITION) {
               row.x = r.x;
               row.y = r.y;
+              row.up.read(r.count, (server.getWorldTimer().getAge() - r.worldTime) * 1000.0);
             } else if (r.type == Record::STATUS) {
               // The record left the client about half a round trip ago.
               row.offsetMs = (r.worldTime + client->getLatency() / 2.0 - server.getWorldTimer().getAge()) * 1000.0;
               row.haveOffset = client->getLatency() > 0;
               row.seenByClient = r.count;
+              row.downMs = r.x;
+              row.downLoss = r.y;
             }
           });
         }
@@ -140,22 +240,23 @@ int runServer(const Options& options) {
       // Relay every entity's position to every client; the key keeps one
       // position per entity waiting.
       for (auto& [client, row] : rows) {
-        for (const Record& p : positions) {
+        for (Record p : positions) {
           if (p.entity == row.entity) continue;
-          client->queueUnreliable(const_cast<Record*>(&p), sizeof p, p.entity, 1);
+          p.count = row.sentDown;
+          client->queueUnreliable(&p, sizeof p, p.entity, 1);
         }
-        client->flushUnreliable();
+        flushCounted(*client, row.sentDown);
       }
       if (tick >= nextSecond) {
         for (auto& [client, row] : rows) {
           row.rate = static_cast<double>(row.messages);
           row.messages = 0;
+          row.up.endSecond();
         }
         nextSecond += std::chrono::seconds(1);
       }
       if (tick >= nextDraw) {
-        drawTable(server, rows, options, first);
-        first = false;
+        drawTable(server, rows, options, lines);
         nextDraw = tick + std::chrono::milliseconds(250);
       }
       std::this_thread::sleep_until(tick + std::chrono::duration_cast<Clock::duration>(std::chrono::duration<double>(kTick)));
@@ -184,6 +285,10 @@ int runClient(const Options& options) {
     auto start = Clock::now();
     bool connected = false;
     unsigned seen = 0;
+    unsigned sentUp = 0;
+    Achieved down;
+    std::FILE* csv = options.csv.empty() ? nullptr : std::fopen(options.csv.c_str(), "w");
+    if (csv != nullptr) std::fprintf(csv, "seconds,latency_ms\n");
     auto nextStatus = start;
     auto nextAttempt = start;
     double phase = (me[std::strlen(me) - 1] - '0') * 0.7;
@@ -212,20 +317,36 @@ int runClient(const Options& options) {
       }
       float world = client.getWorldTimer().getAge();
       Record position{Record::POSITION, 0, static_cast<float>(50 * std::cos(t + phase)),
-                      static_cast<float>(50 * std::sin(1.3 * t + phase)), world, 0};
+                      static_cast<float>(50 * std::sin(1.3 * t + phase)), world, sentUp};
       client.queueUnreliable(&position, sizeof position, 1, 1);
       if (tick >= nextStatus) {
-        Record status{Record::STATUS, 0, 0, 0, world, seen};
+        down.endSecond();
+        Record status{Record::STATUS, 0, static_cast<float>(down.latencyMs), static_cast<float>(down.loss()), world,
+                      seen};
         client.queueReliable(&status, sizeof status, 0, 5);
         nextStatus = tick + std::chrono::seconds(1);
       }
       client.flushReliable();
-      client.flushUnreliable();
+      flushCounted(client, sentUp);
       void* data;
       unsigned size;
-      while (client.poll(data, size)) forEachRecord(data, size, [&](const Record&) { ++seen; });
+      while (client.poll(data, size)) {
+        const float now = client.getWorldTimer().getAge();
+        bool first = true;
+        forEachRecord(data, size, [&](const Record& r) {
+          ++seen;
+          if (r.type != Record::POSITION) return;
+          const double latency = (now - r.worldTime) * 1000.0;
+          down.read(r.count, latency);
+          // One line per message: its records were queued together.
+          if (csv != nullptr && first)
+            std::fprintf(csv, "%.4f,%.3f\n", std::chrono::duration<double>(Clock::now() - start).count(), latency);
+          first = false;
+        });
+      }
       std::this_thread::sleep_until(tick + std::chrono::duration_cast<Clock::duration>(std::chrono::duration<double>(kTick)));
     }
+    if (csv != nullptr) std::fclose(csv);
   } catch (Q_Exception* e) {
     std::printf("client failed: %s\n", e->getErrorMessage());
     return 1;
@@ -234,22 +355,66 @@ int runClient(const Options& options) {
 }
 
 int runWorld(const Options& options) {
+  // The bad network goes where the user means it: by default into the
+  // clients' reads only, so that the server stays a healthy one.
+  const bool clientsSimulate = options.simulateOn != "server";
+  const bool serverSimulates = options.simulateOn != "clients";
   std::vector<std::string> common = {"--port", std::to_string(options.port)};
-  if (options.loss > 0) common.insert(common.end(), {"--loss", std::to_string(options.loss)});
-  if (options.delayMin || options.delayMax)
+  if (clientsSimulate && options.loss > 0) common.insert(common.end(), {"--loss", std::to_string(options.loss)});
+  if (clientsSimulate && (options.delayMin || options.delayMax))
     common.insert(common.end(), {"--delay", std::to_string(options.delayMin) + ":" + std::to_string(options.delayMax)});
+  if (clientsSimulate && !options.model.empty()) common.insert(common.end(), {"--model", options.model});
   std::vector<int> children;
   for (int i = 0; i < options.clients; ++i) {
     std::vector<std::string> args = {"client", "127.0.0.1", "--host", "127.0.0." + std::to_string(i + 2),
                                      "--seconds", "0"};
     args.insert(args.end(), common.begin(), common.end());
+    if (i == 0 && !options.csv.empty()) args.insert(args.end(), {"--csv", options.csv});
     children.push_back(spawnSelf(args, !options.verbose));
   }
   Options server = options;
   server.host = "127.0.0.1";
+  server.simulateHere = serverSimulates;
   int rc = runServer(server);
   for (int pid : children) stopChild(pid);
   return rc;
+}
+
+bool parseModel(const std::string& text, N_NetworkModel& model) {
+  model = N_NetworkModel{};
+  std::size_t at = 0;
+  while (at < text.size()) {
+    std::size_t end = text.find(',', at);
+    if (end == std::string::npos) end = text.size();
+    const std::string item = text.substr(at, end - at);
+    at = end + 1;
+    const std::size_t eq = item.find('=');
+    if (eq == std::string::npos) return false;
+    const std::string key = item.substr(0, eq);
+    const char* value = item.c_str() + eq + 1;
+    if (key == "delay") {
+      model.fDelay = std::strtof(value, nullptr);
+    } else if (key == "jitter") {
+      model.fJitter = std::strtof(value, nullptr);
+    } else if (key == "loss") {
+      model.fLoss = std::strtof(value, nullptr);
+    } else if (key == "dup") {
+      model.fDuplicate = std::strtof(value, nullptr);
+    } else if (key == "reorder") {
+      char* colon = nullptr;
+      model.fReorder = std::strtof(value, &colon);
+      model.fReorderWindow = *colon == ':' ? std::strtof(colon + 1, nullptr) : 0.0f;
+    } else if (key == "cap") {
+      model.uBandwidth = static_cast<unsigned>(std::strtoul(value, nullptr, 10));
+    } else if (key == "queue") {
+      model.uQueueLimit = static_cast<unsigned>(std::strtoul(value, nullptr, 10));
+    } else if (key == "seed") {
+      model.uSeed = static_cast<unsigned>(std::strtoul(value, nullptr, 10));
+    } else {
+      return false;
+    }
+  }
+  return true;
 }
 
 }  // namespace demo

@@ -59,6 +59,7 @@ void N_Client::initializeMembers() {
   m_uUnreliableBytes = 0;
   m_pairingTimer.reset();
   m_bGrantAsked = false;
+  m_pSimulation = nullptr;
 }
 
 void N_Client::construct(const N_Address* pAddress, int iPort) {
@@ -122,6 +123,7 @@ void N_Client::destruct() {
       Q_DeleteArray(entry->pData);
     Q_Delete(queue);
   }
+  deleteSimulation();
   initializeMembers();
 }
 

@@ -106,6 +106,11 @@
 /// exported), so a run that polls in the same order draws the same chances.
 /// Sending and the control channel are never affected. The settings reach the
 /// poll() of every N_Client of the process, a server's ends included.
+/// Because the gate lets one message through per drawn time, it also limits
+/// the rate of reads: what arrives faster waits in the sockets. For a delay
+/// per message, a cap, duplication and reordering without that limit, use
+/// the network model instead (simulateNetwork(), N_NetworkModel), which is
+/// off by default and can run beside these settings.
 ///
 /// @par Ownership
 /// The object owns its three sockets and its two queues. The
@@ -118,6 +123,7 @@
 #include <atomic>
 #include <cstdint>
 
+#include "N_NetworkModel.h"
 #include "N_Socket.h"
 #include "Q_DLList.h"
 #include "Q_Timer.h"
@@ -334,7 +340,8 @@ class VARDEL_API N_Client {
   /// poll(). With simulatePacketLoss() a lost message gives false although
   /// more may wait, and with simulateLatency() poll() gives false while the
   /// drawn delay runs: a `while (poll(...))` loop then ends early, and the rest
-  /// waits for a later pass.
+  /// waits for a later pass. With the network model on, a message waits in the
+  /// model until its time comes (simulateNetwork()).
   bool poll(void*& pMessage, unsigned& uMessageSize);
   /// After every read, poll() of every N_Client of the process stays shut for
   /// a random time between the limits, in milliseconds; 0 and 0 turn it off.
@@ -343,12 +350,32 @@ class VARDEL_API N_Client {
   /// poll() of every N_Client of the process throws away this share (0 to 1)
   /// of the unreliable messages; 0 turns it off. Any thread.
   static void simulatePacketLoss(float fPacketLoss);
+  /// Puts the network model in force for the poll() of every N_Client of the
+  /// process, a server's ends included, from each one's next poll(); a model
+  /// that changes nothing (N_NetworkModel{}) turns it off. Any thread. See
+  /// N_NetworkModel for what it does.
+  /// @note While the model is on, poll() copies the messages it takes from the
+  /// sockets, and may throw Q_MemoryException_Allocation* if a copy can't be
+  /// made; that message is lost.
+  static void simulateNetwork(const N_NetworkModel& model);
+  /// The model set last; N_NetworkModel{} (off) until the first call.
+  static N_NetworkModel getNetworkModel();
+  /// What the network model did to this connection since the model in force
+  /// was set (once it is off, since the last one that was on); all 0 if the
+  /// model never reached this connection's poll().
+  N_SimulationStats getSimulationStats() const;
 
  private:
   friend class N_Server;
   friend struct N_ClientTestAccess;
 
   void initializeMembers();
+  // The network model: this connection's queues, clock and generators
+  // (client_simulation.cpp).
+  struct Simulation;
+  bool simulateArrivals();
+  bool takeSimulated(bool reliable, void*& pMessage, unsigned& uMessageSize);
+  void deleteSimulation();
   // Heartbeat machine, shared by both ends (N_Server drives the server end).
   static bool heartbeatOn();
   void stepHeartbeat();
@@ -390,6 +417,8 @@ class VARDEL_API N_Client {
   // time limit; and a bandwidth request came since the last division.
   Q_Timer m_pairingTimer;
   bool m_bGrantAsked;
+  // Made by the first poll() that finds the network model on.
+  Simulation* m_pSimulation;
 
   static std::atomic<float> sm_fHeartbeatFrequency;
   static std::atomic<float> sm_fHeartbeatLatency;

@@ -24,13 +24,16 @@ double draw() { return static_cast<double>(platform::rand()) * static_cast<doubl
 
 bool N_Client::poll(void*& pMessage, unsigned& uMessageSize) {
   if (!m_bConstructed) return false;
+  // The network model (off by default) takes in what the sockets hold on
+  // every poll, gate shut or not, so that its arrival times are true ones.
+  const bool modelled = simulateArrivals();
   if (m_sendTimer.getAge() < m_fNextPollTime) return false;
 
   bool result = false;
-  if (m_pTcpSocket->poll(pMessage, uMessageSize)) {
+  if (modelled ? takeSimulated(true, pMessage, uMessageSize) : m_pTcpSocket->poll(pMessage, uMessageSize)) {
     // Reliable messages are never thrown away.
     result = true;
-  } else if (m_pUdpSocket->poll(pMessage, uMessageSize)) {
+  } else if (modelled ? takeSimulated(false, pMessage, uMessageSize) : m_pUdpSocket->poll(pMessage, uMessageSize)) {
     const float loss = sm_fSimulatedPacketLoss.load(std::memory_order_relaxed);
     // The message is taken from the socket either way; a lost one is gone.
     result = !(loss > 0.0f && draw() < static_cast<double>(loss));

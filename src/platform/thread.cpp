@@ -78,4 +78,9 @@ int rand() {
 
 void srand(unsigned int seed) { t_randState = seed; }
 
+int rand(unsigned int& state) {
+  state = state * 214013u + 2531011u;
+  return static_cast<int>((state >> 16) & 0x7FFF);
+}
+
 }  // namespace platform

@@ -11,7 +11,8 @@
 //    cannot be started.
 //  - rand yields 0 to 32767 from the same linear congruential generator as the
 //    Microsoft runtime, one state per thread starting at seed 1; srand seeds
-//    the calling thread, so runs are repeatable.
+//    the calling thread, so runs are repeatable. rand(state) steps the same
+//    generator on a state of the caller's own, whichever thread calls.
 #pragma once
 
 #include "vardel_platform.h"
@@ -43,5 +44,7 @@ CWinThread* AfxBeginThread(AFX_THREADPROC pfnThreadProc, void* pParam, int nPrio
 
 int rand();
 void srand(unsigned int seed);
+// The same sequence as srand(state) followed by rand(), on the caller's state.
+int rand(unsigned int& state);
 
 }  // namespace platform

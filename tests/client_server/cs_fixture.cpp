@@ -53,6 +53,7 @@ void ClientServerTest::SetUp() {
   N_Client::setHeartbeatLatency(0.2f);
   N_Client::simulateLatency(0, 0);
   N_Client::simulatePacketLoss(0.0f);
+  N_Client::simulateNetwork(N_NetworkModel{});
   m_balance = std::make_unique<AllocationBalance>();
   m_runtime = std::make_unique<N_Initializer>();
   m_loopback = std::make_unique<N_Address>("127.0.0.1");
@@ -68,6 +69,7 @@ void ClientServerTest::TearDown() {
   N_Client::setHeartbeatLatency(2.0f);
   N_Client::simulateLatency(0, 0);
   N_Client::simulatePacketLoss(0.0f);
+  N_Client::simulateNetwork(N_NetworkModel{});
   const bool settled = waitFor([&] { return m_balance->outstanding() == m_iRefused; }, 10000);
   EXPECT_TRUE(settled) << "library allocations outstanding: " << m_balance->outstanding() << ", refused by faults: "
                        << m_iRefused;

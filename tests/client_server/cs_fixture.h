@@ -103,10 +103,11 @@ double secondsSince(Clock::time_point start);
 std::vector<unsigned char> controlBytes(std::uint32_t type, std::uint32_t value = 0, int size = -1);
 
 // A runtime on 127.0.0.1 for each test. Heartbeats run at 0.2 s / 0.2 s and
-// the simulation is off unless a test says otherwise; all of it is put back
-// afterwards. Every library allocation made during the test must have been
-// given back once the runtime has stopped. Objects of the library must be
-// gone before the test body ends (locals of the body are).
+// the simulation (the gate and the network model) is off unless a test says
+// otherwise; all of it is put back afterwards. Every library allocation made
+// during the test must have been given back once the runtime has stopped.
+// Objects of the library must be gone before the test body ends (locals of
+// the body are).
 class ClientServerTest : public ::testing::Test {
  protected:
   void SetUp() override;

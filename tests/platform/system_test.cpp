@@ -3,6 +3,7 @@
 #include <cstring>
 #include <string>
 #include <thread>
+#include <vector>
 
 #include "fault.h"
 #include "socket_pair.h"
@@ -79,6 +80,30 @@ TEST(Rand, FollowsTheClassicSequencePerThreadAndIsSeedable) {
     int v = platform::rand();
     ASSERT_GE(v, 0);
     ASSERT_LE(v, 32767);
+  }
+}
+
+TEST(Rand, OnAStateOfItsOwnFollowsTheSameSequenceOnAnyThread) {
+  unsigned state = 1;
+  EXPECT_EQ(41, platform::rand(state));
+  EXPECT_EQ(18467, platform::rand(state));
+  EXPECT_EQ(6334, platform::rand(state));
+  // Whatever the thread's own state does meanwhile, and on any thread.
+  for (unsigned seed : {0u, 777u, 0x9E3779B9u}) {
+    platform::srand(seed);
+    std::vector<int> expected(50);
+    for (int& v : expected) v = platform::rand();
+    platform::srand(5);
+    unsigned mine = seed;
+    std::vector<int> got(50);
+    std::thread t([&] {
+      for (int& v : got) {
+        v = platform::rand(mine);
+        platform::rand();
+      }
+    });
+    t.join();
+    EXPECT_EQ(expected, got) << seed;
   }
 }
 
