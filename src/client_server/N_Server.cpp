@@ -6,6 +6,7 @@
 #include "N_Initializer.h"
 #include "Q_Mutex.h"
 #include "Q_New.h"
+#include "RuntimeLock.h"
 
 N_Server::N_Server(int port) : N_Listener(port) {
   initializeMembers();
@@ -116,7 +117,12 @@ void N_Server::acceptData(const N_Limits& limits) {
   // Data connections become clients at once; they stay invisible to the
   // application until their control channel is paired.
   N_Socket::ConnectData* data = nullptr;
-  while (N_Listener::pollConnect(data)) {
+  for (;;) {
+    // Held from poll to hand-over: no new entry can be made meanwhile, so one
+    // that a failed hand-over left behind is told apart from a newer one at
+    // the same address.
+    RuntimeLock hold;
+    if (!N_Listener::pollConnect(data)) break;
     // An accept that failed (no descriptor left) carries no connection.
     if (data->socket == platform::INVALID_SOCKET ||
         !admitUnpaired(limits, data->address.sin_addr.s_addr)) {
@@ -133,7 +139,8 @@ void N_Server::acceptData(const N_Limits& limits) {
       }
     } catch (...) {
       if (!limits.bContainFailures) throw;
-      // Still queued if the client never took it over.
+      // Still queued if the client's data socket never took it over; if it
+      // did, the entry is gone and nothing matches it.
       N_Listener::rejectConnect(data);
     }
   }
@@ -141,7 +148,9 @@ void N_Server::acceptData(const N_Limits& limits) {
 
 void N_Server::acceptControl(const N_Limits& limits) {
   N_Socket::ConnectData* data = nullptr;
-  while (m_pControlListener->pollConnect(data)) {
+  for (;;) {
+    RuntimeLock hold;
+    if (!m_pControlListener->pollConnect(data)) break;
     if (data->socket == platform::INVALID_SOCKET ||
         !admitUnpaired(limits, data->address.sin_addr.s_addr)) {
       m_pControlListener->rejectConnect(data);

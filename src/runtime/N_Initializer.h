@@ -109,6 +109,7 @@ class VARDEL_API N_Initializer {
   friend class N_Listener;
   friend class N_Client;
   friend class N_Server;
+  friend class RuntimeLock;
 
   void start();
   static void stop();
