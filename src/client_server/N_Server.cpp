@@ -125,7 +125,7 @@ void N_Server::acceptData(const N_Limits& limits) {
     if (!N_Listener::pollConnect(data)) break;
     // An accept that failed (no descriptor left) carries no connection.
     if (data->socket == platform::INVALID_SOCKET ||
-        !admitUnpaired(limits, data->address.sin_addr.s_addr)) {
+        !admitUnpaired(limits, data->address.sin_addr.s_addr, false)) {
       N_Listener::rejectConnect(data);
       continue;
     }
@@ -152,7 +152,7 @@ void N_Server::acceptControl(const N_Limits& limits) {
     RuntimeLock hold;
     if (!m_pControlListener->pollConnect(data)) break;
     if (data->socket == platform::INVALID_SOCKET ||
-        !admitUnpaired(limits, data->address.sin_addr.s_addr)) {
+        !admitUnpaired(limits, data->address.sin_addr.s_addr, true)) {
       m_pControlListener->rejectConnect(data);
       continue;
     }
@@ -172,22 +172,58 @@ void N_Server::acceptControl(const N_Limits& limits) {
   }
 }
 
-bool N_Server::admitUnpaired(const N_Limits& limits, unsigned identifier) {
+bool N_Server::admitUnpaired(const N_Limits& limits, unsigned identifier, bool control) {
   if (limits.uMaximumUnpaired == 0 && limits.uMaximumUnpairedPerAddress == 0) return true;
   unsigned all = 0;
   unsigned same = 0;
+  // Waiting connections of the same address that the new one pairs with at
+  // once, so that it takes no place.
+  unsigned partners = 0;
+  // The oldest waiting connection of another address, which makes room when
+  // all places are taken: whoever fills them can't keep a newcomer out, who
+  // pairs within a round trip.
+  N_Client** oldestClient = nullptr;
+  PendingControl* oldestControl = nullptr;
+  double oldestAge = -1.0;
   for (N_Client** entry = m_pClients->getFirst(); entry != nullptr; entry = m_pClients->getNext(entry)) {
-    if ((*entry)->m_pControlSocket != nullptr) continue;
+    N_Client* client = *entry;
+    if (client->m_pControlSocket != nullptr) continue;
     ++all;
-    if ((*entry)->getAddress()->getIdentifier() == identifier) ++same;
+    if (client->getAddress()->getIdentifier() == identifier) {
+      ++same;
+      if (control) ++partners;
+    } else if (client->m_pairingTimer.getAge() > oldestAge) {
+      oldestAge = client->m_pairingTimer.getAge();
+      oldestClient = entry;
+      oldestControl = nullptr;
+    }
   }
   for (PendingControl* entry = m_pPendingControlSockets->getFirst(); entry != nullptr;
        entry = m_pPendingControlSockets->getNext(entry)) {
     ++all;
-    if (entry->pSocket->getAddress()->getIdentifier() == identifier) ++same;
+    if (entry->pSocket->getAddress()->getIdentifier() == identifier) {
+      ++same;
+      if (!control) ++partners;
+    } else if (entry->age.getAge() > oldestAge) {
+      oldestAge = entry->age.getAge();
+      oldestControl = entry;
+      oldestClient = nullptr;
+    }
   }
-  if (limits.uMaximumUnpaired != 0 && all >= limits.uMaximumUnpaired) return false;
-  return limits.uMaximumUnpairedPerAddress == 0 || same < limits.uMaximumUnpairedPerAddress;
+  if (partners > 0) return true;
+  if (limits.uMaximumUnpairedPerAddress != 0 && same >= limits.uMaximumUnpairedPerAddress) return false;
+  if (limits.uMaximumUnpaired == 0 || all < limits.uMaximumUnpaired) return true;
+  if (oldestClient != nullptr) {
+    freeClient(*oldestClient);
+    m_pClients->remove(oldestClient);
+    return true;
+  }
+  if (oldestControl != nullptr) {
+    Q_Delete(oldestControl->pSocket);
+    m_pPendingControlSockets->remove(oldestControl);
+    return true;
+  }
+  return false;
 }
 
 void N_Server::dropUnpaired(float timeout) {

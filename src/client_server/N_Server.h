@@ -203,7 +203,7 @@ class VARDEL_API N_Server : public N_Listener {
   void acceptData(const N_Limits& limits);
   void acceptControl(const N_Limits& limits);
   // Whether one more connection of `identifier` may wait to be paired.
-  bool admitUnpaired(const N_Limits& limits, unsigned identifier);
+  bool admitUnpaired(const N_Limits& limits, unsigned identifier, bool control);
   void dropUnpaired(float timeout);
   void pair();
   bool sendBacklogExceeded(N_Client* client, const N_Limits& limits);

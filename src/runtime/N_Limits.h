@@ -50,8 +50,12 @@ struct VARDEL_API N_Limits {
   /// however young.
   float fPairingTimeout;
   /// Connections waiting to be paired (data connections without control and
-  /// control connections without client) that N_Server keeps in all; a
-  /// connection beyond it is closed on arrival.
+  /// control connections without client) that N_Server keeps in all. When
+  /// they are all taken, a new connection closes the oldest waiting one of
+  /// another IPv4 address and takes its place, so that whoever fills them
+  /// can't keep a newcomer out; if all are of its own address, it is closed
+  /// on arrival. A connection that pairs at once with one already waiting
+  /// takes no place.
   unsigned uMaximumUnpaired;
   /// As uMaximumUnpaired, for the connections from one IPv4 address.
   unsigned uMaximumUnpairedPerAddress;

@@ -433,6 +433,32 @@ TEST_F(ServerLimitsTest, UnpairedConnectionsAreBoundedAndReleased) {
   EXPECT_TRUE(waitFor([&] { return N_ServerTestAccess::clientCount(server) == 0; }, 5000, pump));
 }
 
+// All places taken by other addresses: a newcomer takes the oldest one's
+// place, and its control connection, which pairs at once, takes none.
+TEST_F(ServerLimitsTest, ANewcomerTakesTheOldestWaitingPlace) {
+  N_Limits l = limits();
+  l.fPairingTimeout = 600.0f;
+  l.uMaximumUnpaired = 2;
+  l.uMaximumUnpairedPerAddress = 0;
+  LimitsGuard guard(l);
+  N_Server server(port());
+  ServerPump pump{server};
+  const int oldest = raw::connectFrom("127.0.0.5", "127.0.0.1", static_cast<std::uint16_t>(port()));
+  ASSERT_GE(oldest, 0);
+  ASSERT_TRUE(waitFor([&] { return N_ServerTestAccess::clientCount(server) == 1; }, 5000, pump));
+  const int younger = raw::connectFrom("127.0.0.6", "127.0.0.1", static_cast<std::uint16_t>(port()));
+  ASSERT_GE(younger, 0);
+  ASSERT_TRUE(waitFor([&] { return N_ServerTestAccess::clientCount(server) == 2; }, 5000, pump));
+  ScriptedClient newcomer(loopback(), port());
+  N_Client* client = nullptr;
+  ASSERT_TRUE(pairUp(pump, newcomer, client));
+  EXPECT_TRUE(raw::closedByPeer(oldest, 5000));
+  EXPECT_FALSE(raw::closedByPeer(younger, 200));
+  EXPECT_EQ(2, N_ServerTestAccess::clientCount(server));
+  raw::closeFd(oldest);
+  raw::closeFd(younger);
+}
+
 // A budget of control messages per client and update, and the requests of
 // one update divided once, with grants only where they changed or were
 // asked for.

@@ -56,10 +56,14 @@ int acceptOne(int listener, int timeoutMs) {
   return ::accept4(listener, nullptr, nullptr, SOCK_CLOEXEC);
 }
 
-int connectTo(const char* ip, std::uint16_t port) {
+int connectTo(const char* ip, std::uint16_t port) { return connectFrom(nullptr, ip, port); }
+
+int connectFrom(const char* from, const char* ip, std::uint16_t port) {
   int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_in local = address(from != nullptr ? from : "0.0.0.0", 0);
   sockaddr_in a = address(ip, port);
-  if (::connect(fd, reinterpret_cast<sockaddr*>(&a), sizeof a) != 0) {
+  if ((from != nullptr && ::bind(fd, reinterpret_cast<sockaddr*>(&local), sizeof local) != 0) ||
+      ::connect(fd, reinterpret_cast<sockaddr*>(&a), sizeof a) != 0) {
     ::close(fd);
     return -1;
   }

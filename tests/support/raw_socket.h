@@ -17,6 +17,8 @@ int listenOn(const char* ip, std::uint16_t& port);
 int acceptOne(int listener, int timeoutMs);
 // A blocking connect; -1 on failure.
 int connectTo(const char* ip, std::uint16_t port);
+// The same from the local address `from`, as a host of its own.
+int connectFrom(const char* from, const char* ip, std::uint16_t port);
 bool sendAll(int fd, const void* data, std::size_t size);
 // Reads exactly `size` bytes within `timeoutMs`; false on time-out or close.
 bool receiveExactly(int fd, void* data, std::size_t size, int timeoutMs);
