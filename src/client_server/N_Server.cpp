@@ -273,8 +273,11 @@ bool N_Server::sendBacklogExceeded(N_Client* client, const N_Limits& limits) {
   if (limits.fSendBacklogSeconds <= 0.0f || !client->isConnected()) return false;
   double bound = static_cast<double>(limits.fSendBacklogSeconds) * client->m_uBandwidth;
   if (bound < limits.uMinimumSendBacklog) bound = limits.uMinimumSendBacklog;
-  for (N_Socket* socket : {client->m_pTcpSocket, client->m_pUdpSocket, client->m_pControlSocket})
-    if (socket != nullptr && socket->getQueuedSendBytes() > bound) return true;
+  for (N_Socket* socket : {client->m_pTcpSocket, client->m_pUdpSocket, client->m_pControlSocket}) {
+    if (socket == nullptr) continue;
+    const double cost = socket->getQueuedSendBytes() + double{N_Limits::kMessageCharge} * socket->getQueuedSendMessages();
+    if (cost > bound) return true;
+  }
   return false;
 }
 

@@ -67,7 +67,9 @@ void N_Socket::initializeMembers() {
   m_uPumpHeldPass = 0;
   m_iPacketCapacity = 0;
   m_uQueuedSendBytes = 0;
+  m_uQueuedSendMessages = 0;
   m_uQueuedReceiveBytes = 0;
+  m_uQueuedReceiveMessages = 0;
   m_bReadPaused = false;
   m_bReadResume = false;
 }
@@ -248,6 +250,7 @@ bool N_Socket::poll(void*& data, unsigned int& size) {
         size = entry->wsaBuf.len;
         entry->bConsumed = true;
         m_uQueuedReceiveBytes -= entry->wsaBuf.len;
+        --m_uQueuedReceiveMessages;
         found = true;
         break;
       }
@@ -259,7 +262,7 @@ bool N_Socket::poll(void*& data, unsigned int& size) {
       entry = next;
     }
   }
-  if (m_bReadPaused && m_uQueuedReceiveBytes < N_Initializer::getLimits().uReceiveBacklog) {
+  if (m_bReadPaused && receiveBacklogCost() < N_Initializer::getLimits().uReceiveBacklog) {
     m_bReadPaused = false;
     m_bReadResume = true;
     N_Initializer::m_bReadsToResume = true;
@@ -305,6 +308,24 @@ unsigned int N_Socket::getQueuedSendBytes() const {
   unsigned int bytes = m_uQueuedSendBytes;
   ReleaseMutex(N_Initializer::m_hMutex);
   return bytes;
+}
+
+unsigned int N_Socket::getQueuedSendMessages() const {
+  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  unsigned int messages = m_uQueuedSendMessages;
+  ReleaseMutex(N_Initializer::m_hMutex);
+  return messages;
+}
+
+unsigned int N_Socket::getQueuedReceiveMessages() const {
+  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  unsigned int messages = m_uQueuedReceiveMessages;
+  ReleaseMutex(N_Initializer::m_hMutex);
+  return messages;
+}
+
+std::uint64_t N_Socket::receiveBacklogCost() const {
+  return m_uQueuedReceiveBytes + std::uint64_t{m_uQueuedReceiveMessages} * N_Limits::kMessageCharge;
 }
 
 unsigned int N_Socket::getQueuedReceiveBytes() const {

@@ -202,9 +202,14 @@ class VARDEL_API N_Socket {
   /// This socket's own share of that: bytes still to be sent, prefixes
   /// included.
   unsigned int getQueuedSendBytes() const;
+  /// How many entries (messages, or parts of a message larger than the
+  /// system's send buffer) those bytes are in.
+  unsigned int getQueuedSendMessages() const;
   /// Bytes of received messages that poll() hasn't handed out yet. With a
   /// receive backlog set (N_Limits) the socket stops reading at that bound.
   unsigned int getQueuedReceiveBytes() const;
+  /// How many messages those bytes are in.
+  unsigned int getQueuedReceiveMessages() const;
 
   /// The first slot of the runtime's socket registry, null if there is none
   /// (or the runtime is down); `*slot` is the socket. See the class about
@@ -311,10 +316,14 @@ class VARDEL_API N_Socket {
   // Bytes allocated for m_pPacketBuffer while a body is collected; below
   // length + 4 while a long message grows with what arrived.
   std::int64_t m_iPacketCapacity;
-  // Sums kept under the runtime's mutex: bytes of this socket on the
-  // out-queue, and of its messages that poll() hasn't handed out.
+  // Sums kept under the runtime's mutex: bytes and entries of this socket on
+  // the out-queue, and of its messages that poll() hasn't handed out.
   unsigned int m_uQueuedSendBytes;
+  unsigned int m_uQueuedSendMessages;
   unsigned int m_uQueuedReceiveBytes;
+  unsigned int m_uQueuedReceiveMessages;
+  // What the unpolled messages count against the receive backlog.
+  std::uint64_t receiveBacklogCost() const;
   // Reading stopped at the receive backlog; poll() sets m_bReadResume when
   // the backlog fell below it, and the network thread then posts the read.
   bool m_bReadPaused;

@@ -110,6 +110,7 @@ N_Socket::DataQueue* N_Socket::appendMessage(char* buffer, char* data, unsigned 
   message->bLive = true;
   message->pSocket = this;
   m_uQueuedReceiveBytes += size;
+  ++m_uQueuedReceiveMessages;
   return message;
 }
 
@@ -132,6 +133,7 @@ bool N_Socket::deliver(DataQueue* read, DataQueue* message) {
   // A message that poll() handed out meanwhile stays for the next poll().
   if (!keep && !message->bConsumed) {
     m_uQueuedReceiveBytes -= message->wsaBuf.len;
+    --m_uQueuedReceiveMessages;
     Q_DeleteArray(message->pBuffer);
     m_pReceiveQueue->remove(message);
   }

@@ -118,6 +118,7 @@ void N_Socket::send(void* data, unsigned int size) {
     N_Initializer::m_uBytesWaitingForSend += c.length;
     m_uQueuedSendBytes += c.length;
   }
+  m_uQueuedSendMessages += static_cast<unsigned int>(chunks.size());
   if (N_Initializer::m_pPumpFrom == nullptr) N_Initializer::m_pPumpFrom = first;
   N_Initializer::releaseThreadLoop();
   ReleaseMutex(N_Initializer::m_hMutex);
@@ -149,7 +150,10 @@ void N_Socket::sendComplete(DWORD dwError, DWORD cbTransferred, OVERLAPPED* lpOv
     socket->m_bWriteCompletionPending = false;
   }
   N_Initializer::m_uBytesWaitingForSend -= entry->wsaBuf.len;
-  if (socket != nullptr) socket->m_uQueuedSendBytes -= entry->wsaBuf.len;
+  if (socket != nullptr) {
+    socket->m_uQueuedSendBytes -= entry->wsaBuf.len;
+    --socket->m_uQueuedSendMessages;
+  }
   if (N_Initializer::m_pPumpFrom == entry) N_Initializer::m_pPumpFrom = N_Initializer::m_pOutProcessQueue->getNext(entry);
   N_Initializer::m_pOutProcessQueue->remove(entry);
   ReleaseMutex(N_Initializer::m_hMutex);

@@ -33,6 +33,11 @@
 #include "vardel_export.h"
 
 struct VARDEL_API N_Limits {
+  /// What a waiting message counts against the receive and send backlogs
+  /// beyond its own bytes: the memory of the record that holds it, so that
+  /// a flood of tiny messages is bounded as tightly as one of large ones.
+  static constexpr unsigned kMessageCharge = 128;
+
   /// @name Accepting
   /// @{
 
@@ -85,11 +90,13 @@ struct VARDEL_API N_Limits {
   bool bCompactMessages;
   /// Bytes of received messages not yet polled at which a socket stops
   /// reading; the system's buffers then fill and TCP slows the peer down.
-  /// Reading resumes once poll() brought the backlog below the bound.
+  /// Reading resumes once poll() brought the backlog below the bound. Each
+  /// message counts kMessageCharge bytes beyond its own.
   unsigned uReceiveBacklog;
   /// N_Server disconnects a client (all three channels, as the heartbeat
   /// does) when one of its sockets holds more unsent bytes than this many
   /// seconds of its bandwidth, but never for fewer than uMinimumSendBacklog.
+  /// Each waiting message counts kMessageCharge bytes beyond its own.
   float fSendBacklogSeconds;
   /// The unsent bytes below which fSendBacklogSeconds never disconnects.
   unsigned uMinimumSendBacklog;

@@ -147,7 +147,7 @@ void N_Initializer::serveEvent(WSAEVENT handle) {
       // A socket whose unpolled messages passed the bound stops reading, so
       // that the peer's TCP waits; poll() lets it go on.
       unsigned backlog = getLimits().uReceiveBacklog;
-      if (backlog != 0 && socket->m_uQueuedReceiveBytes >= backlog)
+      if (backlog != 0 && socket->receiveBacklogCost() >= backlog)
         socket->m_bReadPaused = true;
       else
         socket->postRead();

@@ -129,10 +129,15 @@ TEST_F(LimitsTest, ReceiveBacklogPushesBackOnThePeer) {
     }
     written = true;
   });
-  // Reading stops near the bound (one read may land beyond it).
-  EXPECT_TRUE(waitFor([&] { return in.getQueuedReceiveBytes() >= limits.uReceiveBacklog; }));
+  // Reading stops near the bound, each message charged for its record (one
+  // read may land beyond it).
+  const auto cost = [&] {
+    return in.getQueuedReceiveBytes() + std::uint64_t{N_Limits::kMessageCharge} * in.getQueuedReceiveMessages();
+  };
+  EXPECT_TRUE(waitFor([&] { return cost() >= limits.uReceiveBacklog; }));
   EXPECT_TRUE(staysFalse([&] { return written.load(); }, 300));
-  EXPECT_LE(in.getQueuedReceiveBytes(), limits.uReceiveBacklog + 65536 + 4096);
+  EXPECT_EQ(in.getQueuedReceiveBytes(), 1024 * in.getQueuedReceiveMessages());
+  EXPECT_LE(cost(), limits.uReceiveBacklog + (65536 + 4096) / 1024 * (1024 + N_Limits::kMessageCharge));
   Bytes got;
   for (int i = 0; i < kMessages; ++i) {
     ASSERT_TRUE(pollMessage(in, got)) << i;
@@ -141,6 +146,30 @@ TEST_F(LimitsTest, ReceiveBacklogPushesBackOnThePeer) {
   writer.join();
   EXPECT_TRUE(written.load());
   EXPECT_EQ(0u, in.getQueuedReceiveBytes());
+  EXPECT_EQ(0u, in.getQueuedReceiveMessages());
+  raw::closeFd(fd);
+}
+
+// What a peer that doesn't read leaves waiting is counted in bytes, prefixes
+// included, and in messages, until it reads.
+TEST_F(LimitsTest, WhatWaitsToBeSentIsCountedUntilItLeaves) {
+  const int port = freePort();
+  N_Listener listener(port);
+  N_Socket out;
+  int fd = -1;
+  ASSERT_TRUE(acceptRaw(listener, port, out, fd));
+  constexpr int kMessages = 4000;  // 4 MiB, beyond what the system buffers of both ends hold
+  for (int i = 0; i < kMessages; ++i) out.send(pattern(1024, static_cast<unsigned>(i)).data(), 1024);
+  EXPECT_TRUE(waitFor([&] { return out.getQueuedSendMessages() < kMessages; }));
+  EXPECT_TRUE(staysFalse([&] { return out.getQueuedSendMessages() == 0; }, 200));
+  EXPECT_EQ((1024u + 4) * out.getQueuedSendMessages(), out.getQueuedSendBytes());
+  std::uint64_t received = 0;
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+  while (received < std::uint64_t{kMessages} * 1028 && std::chrono::steady_clock::now() < deadline)
+    received += raw::receiveFor(fd, 100).size();
+  EXPECT_EQ(std::uint64_t{kMessages} * 1028, received);
+  EXPECT_TRUE(waitFor([&] { return out.getQueuedSendMessages() == 0; }));
+  EXPECT_EQ(0u, out.getQueuedSendBytes());
   raw::closeFd(fd);
 }
 
