@@ -117,18 +117,14 @@ void N_Server::acceptData(const N_Limits& limits) {
   // Data connections become clients at once; they stay invisible to the
   // application until their control channel is paired.
   N_Socket::ConnectData* data = nullptr;
-  for (;;) {
-    // Held from poll to hand-over: no new entry can be made meanwhile, so one
-    // that a failed hand-over left behind is told apart from a newer one at
-    // the same address.
-    RuntimeLock hold;
-    if (!N_Listener::pollConnect(data)) break;
+  while (N_Listener::pollConnect(data)) {
     // An accept that failed (no descriptor left) carries no connection.
     if (data->socket == platform::INVALID_SOCKET ||
         !admitUnpaired(limits, data->address.sin_addr.s_addr, false)) {
       N_Listener::rejectConnect(data);
       continue;
     }
+    const platform::SOCKET socket = data->socket;
     try {
       N_Client** slot = m_pClients->append();
       try {
@@ -139,18 +135,14 @@ void N_Server::acceptData(const N_Limits& limits) {
       }
     } catch (...) {
       if (!limits.bContainFailures) throw;
-      // Still queued if the client's data socket never took it over; if it
-      // did, the entry is gone and nothing matches it.
-      N_Listener::rejectConnect(data);
+      rejectUnlessTaken(data, socket);
     }
   }
 }
 
 void N_Server::acceptControl(const N_Limits& limits) {
   N_Socket::ConnectData* data = nullptr;
-  for (;;) {
-    RuntimeLock hold;
-    if (!m_pControlListener->pollConnect(data)) break;
+  while (m_pControlListener->pollConnect(data)) {
     if (data->socket == platform::INVALID_SOCKET ||
         !admitUnpaired(limits, data->address.sin_addr.s_addr, true)) {
       m_pControlListener->rejectConnect(data);
@@ -167,7 +159,23 @@ void N_Server::acceptControl(const N_Limits& limits) {
       }
     } catch (...) {
       if (!limits.bContainFailures) throw;
+      // A socket that failed to come up leaves its entry queued.
       m_pControlListener->rejectConnect(data);
+    }
+  }
+}
+
+void N_Server::rejectUnlessTaken(N_Socket::ConnectData* data, platform::SOCKET socket) {
+  // A client that took the entry over and then failed has freed it, and a
+  // newer entry may stand at its address now; that one holds another handle,
+  // since a handle comes back only after 2^24 reuses of its slot.
+  RuntimeLock hold;
+  Q_DLList<N_Socket::ConnectData>* queue = N_Initializer::m_pConnectQueue;
+  for (N_Socket::ConnectData* entry = queue != nullptr ? queue->getFirst() : nullptr; entry != nullptr;
+       entry = queue->getNext(entry)) {
+    if (entry == data && entry->socket == socket) {
+      N_Listener::rejectConnect(data);
+      return;
     }
   }
 }

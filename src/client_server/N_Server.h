@@ -204,6 +204,7 @@ class VARDEL_API N_Server : public N_Listener {
   void acceptControl(const N_Limits& limits);
   // Whether one more connection of `identifier` may wait to be paired.
   bool admitUnpaired(const N_Limits& limits, unsigned identifier, bool control);
+  void rejectUnlessTaken(N_Socket::ConnectData* data, platform::SOCKET socket);
   void dropUnpaired(float timeout);
   void pair();
   bool sendBacklogExceeded(N_Client* client, const N_Limits& limits);

@@ -127,7 +127,9 @@ TEST(Names, LocalHostCanBeChosenAndLookupsGivePerThreadRecords) {
   t.join();
   EXPECT_NE(mine, theirs);
   EXPECT_EQ(nullptr, gethostbyname("no-such-host.invalid"));
-  EXPECT_EQ(WSAHOST_NOT_FOUND, WSAGetLastError());
+  // Not found; or, on a machine without a reachable name server, try again.
+  const int error = WSAGetLastError();
+  EXPECT_TRUE(error == WSAHOST_NOT_FOUND || error == WSATRY_AGAIN) << error;
 
   std::uint32_t loop = inet_addr("127.0.0.1");
   hostent* reverse = gethostbyaddr(reinterpret_cast<char*>(&loop), 4, AF_INET);
