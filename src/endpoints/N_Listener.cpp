@@ -121,6 +121,8 @@ bool N_Listener::rejectConnect(N_Socket::ConnectData* data) {
     if (entry->socket != INVALID_SOCKET && entry->socket != 0) N_Socket::chkErr(closesocket(entry->socket));
     queue->remove(entry);
     found = true;
+    // The listener may have stopped accepting at a full queue.
+    N_Initializer::releaseThreadLoop();
     break;
   }
   ReleaseMutex(N_Initializer::m_hMutex);

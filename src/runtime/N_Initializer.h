@@ -135,6 +135,8 @@ class VARDEL_API N_Initializer {
   // Posts the reads of sockets whose receive backlog has fallen below its
   // bound since their reading paused.
   static void resumeReads();
+  // Entries of the connect queue that belong to `listener`.
+  static unsigned queuedConnects(const N_Listener* listener);
   static void pumpSends();
   static void serveEvent(platform::WSAEVENT handle);
   // Completion routine of the reads that the pass posts.

@@ -48,6 +48,12 @@ struct VARDEL_API N_Limits {
   /// failed for lack of descriptors or memory (the connection stays in the
   /// system's backlog and is accepted once there is room again).
   float fAcceptBackoff;
+  /// Accepted connections a listener keeps waiting for pollConnect(); at
+  /// this many it stops accepting until the application took or refused
+  /// some. The system's backlog holds the rest and refuses what doesn't fit,
+  /// so a connect flood can't pile up descriptors and memory faster than
+  /// update() serves them. 0: no bound.
+  unsigned uMaximumAcceptQueue;
   /// Seconds that N_Server keeps an accepted data connection without its
   /// control connection, or a control connection without its client, before
   /// it closes and frees it. With a time limit set, connections whose peer
@@ -119,7 +125,8 @@ struct VARDEL_API N_Limits {
   /// (0.25 s).
   static N_Limits defaults();
   /// Every protection on, with the values documented in the README: listeners
-  /// first, 0.25 s accept rest, 5 s pairing limit, 32 unpaired connections (4
+  /// first, 0.25 s accept rest, 64 accepted connections waiting per listener,
+  /// 5 s pairing limit, 32 unpaired connections (4
   /// per address), contained failures, 1 MiB messages, compact messages, 1 MiB
   /// receive backlog, 8 s (at least 256 KiB) send backlog, 64 control
   /// messages per client and update, collected bandwidth requests.

@@ -22,6 +22,7 @@ N_Limits N_Limits::defaults() {
   N_Limits limits{};
   limits.bListenersFirst = false;
   limits.fAcceptBackoff = 0.25f;
+  limits.uMaximumAcceptQueue = 0;
   limits.fPairingTimeout = 0.0f;
   limits.uMaximumUnpaired = 0;
   limits.uMaximumUnpairedPerAddress = 0;
@@ -40,6 +41,7 @@ N_Limits N_Limits::defaults() {
 N_Limits N_Limits::openNetwork() {
   N_Limits limits = defaults();
   limits.bListenersFirst = true;
+  limits.uMaximumAcceptQueue = 64;
   limits.fPairingTimeout = 5.0f;
   limits.uMaximumUnpaired = 32;
   limits.uMaximumUnpairedPerAddress = 4;

@@ -14,7 +14,8 @@
 using namespace platform;
 
 DWORD N_Initializer::buildWaitSet(WSAEVENT* events, DWORD& timeout) {
-  const bool listenersFirst = getLimits().bListenersFirst;
+  const N_Limits limits = getLimits();
+  const bool listenersFirst = limits.bListenersFirst;
   DWORD count = 0;
   timeout = WSA_INFINITE;
   events[count++] = m_eventRelease;
@@ -31,6 +32,8 @@ DWORD N_Initializer::buildWaitSet(WSAEVENT* events, DWORD& timeout) {
         continue;
       }
       listener->m_fRestSeconds = 0.0f;
+      // A full accept queue: taking or refusing an entry wakes the thread.
+      if (limits.uMaximumAcceptQueue != 0 && queuedConnects(listener) >= limits.uMaximumAcceptQueue) continue;
       events[count++] = listener->m_event;
     }
   };
@@ -43,6 +46,14 @@ DWORD N_Initializer::buildWaitSet(WSAEVENT* events, DWORD& timeout) {
     if (*slot != nullptr) events[count++] = (*slot)->m_event;
   if (!listenersFirst) addListeners();
   return count;
+}
+
+unsigned N_Initializer::queuedConnects(const N_Listener* listener) {
+  unsigned queued = 0;
+  for (N_Socket::ConnectData* entry = m_pConnectQueue->getFirst(); entry != nullptr;
+       entry = m_pConnectQueue->getNext(entry))
+    if (entry->pListener == listener) ++queued;
+  return queued;
 }
 
 void N_Initializer::resumeReads() {
