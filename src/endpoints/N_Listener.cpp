@@ -59,7 +59,8 @@ void N_Listener::construct(int port) {
   // event once the registry below has it.
   N_Socket::chkErr(WSAEventSelect(m_socket, m_event, FD_ACCEPT));
   N_Socket::chkErr(bind(m_socket, reinterpret_cast<const sockaddr*>(&m_localAddress), sizeof m_localAddress));
-  N_Socket::chkErr(listen(m_socket, SOMAXCONN));
+  const unsigned backlog = N_Initializer::getLimits().uListenBacklog;
+  N_Socket::chkErr(listen(m_socket, backlog != 0 ? static_cast<int>(backlog) : SOMAXCONN));
   int length = sizeof m_localAddress;
   N_Socket::chkErr(getsockname(m_socket, reinterpret_cast<sockaddr*>(&m_localAddress), &length));
   try {

@@ -54,6 +54,11 @@ struct VARDEL_API N_Limits {
   /// so a connect flood can't pile up descriptors and memory faster than
   /// update() serves them. 0: no bound.
   unsigned uMaximumAcceptQueue;
+  /// Connections the system keeps for a listener made while this is set,
+  /// before any is accepted; beyond it a new one waits for its connect to be
+  /// retried. Small, it keeps a flood from leaving thousands of dead
+  /// connections to work through after it. 0: the system's largest.
+  unsigned uListenBacklog;
   /// Seconds that N_Server keeps an accepted data connection without its
   /// control connection, or a control connection without its client, before
   /// it closes and frees it. With a time limit set, connections whose peer
@@ -125,7 +130,8 @@ struct VARDEL_API N_Limits {
   /// (0.25 s).
   static N_Limits defaults();
   /// Every protection on, with the values documented in the README: listeners
-  /// first, 0.25 s accept rest, 64 accepted connections waiting per listener,
+  /// first, 0.25 s accept rest, 64 accepted connections waiting per listener
+  /// and 64 in the system's backlog,
   /// 5 s pairing limit, 32 unpaired connections (4
   /// per address), contained failures, 1 MiB messages, compact messages, 1 MiB
   /// receive backlog, 8 s (at least 256 KiB) send backlog, 64 control

@@ -23,6 +23,7 @@ N_Limits N_Limits::defaults() {
   limits.bListenersFirst = false;
   limits.fAcceptBackoff = 0.25f;
   limits.uMaximumAcceptQueue = 0;
+  limits.uListenBacklog = 0;
   limits.fPairingTimeout = 0.0f;
   limits.uMaximumUnpaired = 0;
   limits.uMaximumUnpairedPerAddress = 0;
@@ -42,6 +43,7 @@ N_Limits N_Limits::openNetwork() {
   N_Limits limits = defaults();
   limits.bListenersFirst = true;
   limits.uMaximumAcceptQueue = 64;
+  limits.uListenBacklog = 64;
   limits.fPairingTimeout = 5.0f;
   limits.uMaximumUnpaired = 32;
   limits.uMaximumUnpairedPerAddress = 4;
