@@ -2,6 +2,7 @@
 // an address of its own (127.0.0.2 and up), so that every channel works as
 // it would between machines, the unreliable one included.
 #include <algorithm>
+#include <map>
 #include <set>
 
 #include "cs_fixture.h"
@@ -11,146 +12,134 @@ using namespace cs_test;
 
 namespace {
 
-using Access = N_ClientTestAccess;
+const std::vector<std::string> kSlowHeartbeat = {"--hb-frequency", "1", "--hb-latency", "1"};
 
-std::vector<std::string> heartbeat(const char* frequency, const char* latency) {
-  return {"--hb-frequency", frequency, "--hb-latency", latency};
+#if defined(__SANITIZE_THREAD__) || defined(__SANITIZE_ADDRESS__)
+constexpr int kPayloads = 60;  // twenty instrumented processes share the cores
+#else
+constexpr int kPayloads = 300;
+#endif
+
+// The payloads "<prefix><i>;" in a batch.
+std::vector<std::string> split(const std::string& batch) {
+  std::vector<std::string> out;
+  std::size_t start = 0;
+  for (std::size_t end; (end = batch.find(';', start)) != std::string::npos; start = end + 1)
+    out.push_back(batch.substr(start, end - start));
+  return out;
+}
+
+// Every payload the server's end of a client can read now. With simulated
+// loss a false read doesn't mean that nothing is left, so it reads a fixed
+// number of times (a read that finds nothing draws nothing).
+std::vector<std::string> readPayloads(N_Client& client, int reads = 500) {
+  std::vector<std::string> out;
+  void* m = nullptr;
+  unsigned n = 0;
+  for (int i = 0; i < reads; ++i)
+    if (client.poll(m, n))
+      for (std::string& p : split(std::string(static_cast<const char*>(m), n))) out.push_back(std::move(p));
+  return out;
+}
+
+std::vector<int> indicesOf(const std::vector<std::string>& payloads, char prefix) {
+  std::vector<int> out;
+  for (const std::string& p : payloads)
+    if (!p.empty() && p[0] == prefix) out.push_back(std::atoi(p.c_str() + 1));
+  return out;
 }
 
 class ClientServerProcessTest : public ClientServerTest {
  protected:
-  // The server's object for the peer on `host`, once it was handed out.
-  static N_Client* clientOf(const ServerPump& pump, const std::string& host) {
-    for (N_Client* c : pump.announced()) {
-      const volatile char* number = c->getAddress()->getStringNumber();
-      if (number != nullptr && host == const_cast<const char*>(number)) return c;
-    }
-    return nullptr;
-  }
-  // Pumps until the peer reports its connection and the server handed it out.
-  static N_Client* admit(PeerProcess& peer, const ServerPump& pump) {
-    if (!peer.waitLine("connected", 20000, pump)) return nullptr;
-    N_Client* client = nullptr;
-    waitFor([&] { return (client = clientOf(pump, peer.host())) != nullptr; }, 5000, pump);
-    return client;
-  }
-  // Every message that the server's end of a client can read now, split
-  // into the payloads of the batches. With simulated loss a false result
-  // doesn't mean that nothing is left, so it reads a fixed number of times
-  // (a read that finds nothing draws nothing).
-  static std::vector<std::string> readPayloads(N_Client& client, int reads = 500) {
-    std::vector<std::string> out;
-    void* m = nullptr;
-    unsigned n = 0;
-    for (int i = 0; i < reads; ++i) {
-      if (!client.poll(m, n)) continue;
-      std::string text(static_cast<const char*>(m), n);
-      std::size_t start = 0;
-      for (std::size_t end; (end = text.find(';', start)) != std::string::npos; start = end + 1)
-        out.push_back(text.substr(start, end - start));
-    }
-    return out;
-  }
-  static std::vector<int> indicesOf(const std::vector<std::string>& payloads, char prefix) {
-    std::vector<int> out;
-    for (const std::string& p : payloads)
-      if (!p.empty() && p[0] == prefix) out.push_back(std::atoi(p.c_str() + 1));
-    return out;
+  void SetUp() override {
+    ClientServerTest::SetUp();
+    heartbeat(1.0f, 1.0f);
   }
 };
 
-TEST_F(ClientServerProcessTest, ThreeClientsConnectMeasureLatencyAndLeave) {
+class ClientsTest : public ClientServerProcessTest, public ::testing::WithParamInterface<int> {};
+
+// Up to twenty clients, as many as the network thread's wait set holds
+// (three sockets each, beside the two listeners and the release event): each
+// handed out once with its own address, round trips measured at both ends,
+// reliable payloads answered in order and datagrams carried, then all leave.
+TEST_P(ClientsTest, ExchangeAndLeave) {
+  const int count = GetParam();
   N_Server server(port());
+  server.setBandwidth(4000000);
+  server.setMaximumBandwidthUsage(100000);
   ServerPump pump(server);
-  std::vector<std::unique_ptr<PeerProcess>> peers;
-  for (int host = 2; host <= 4; ++host)
-    peers.push_back(std::make_unique<PeerProcess>(host, port(), heartbeat("0.2", "0.2")));
-  std::set<N_Client*> clients;
-  for (auto& peer : peers) {
-    ASSERT_TRUE(peer->started());
-    N_Client* client = admit(*peer, pump);
-    ASSERT_NE(nullptr, client) << peer->host();
-    clients.insert(client);
-  }
-  // Each handed out once, none twice.
-  pumpFor(300, pump);
-  EXPECT_EQ(3u, pump.announced().size());
-  EXPECT_EQ(3u, clients.size());
-
-  // Round trips measured at both ends.
-  for (auto& peer : peers) {
-    auto line = peer->waitLine("latency", 5000, pump);
-    ASSERT_TRUE(line) << peer->host();
-    EXPECT_GT(valueOf(*line), 0.0);
-    EXPECT_LT(valueOf(*line), 1.0);
-  }
-  for (N_Client* client : clients) {
-    EXPECT_TRUE(waitFor([&] { return client->getLatency() > 0.0f; }, 5000, pump));
-    EXPECT_LT(client->getLatency(), 1.0f);
-    EXPECT_TRUE(client->isConnected());
-  }
-
-  for (auto& peer : peers) EXPECT_TRUE(peer->quit(10000, pump)) << peer->host();
-  for (N_Client* client : clients) {
-    EXPECT_TRUE(waitFor([&] { return !client->isConnected(); }, 5000, pump));
-    server.disconnectClient(client);
-  }
-  EXPECT_EQ(0, N_ServerTestAccess::clientCount(server));
-}
-
-TEST_F(ClientServerProcessTest, GrantsFollowTheWorkedExamples) {
-  N_Client::setHeartbeatFrequency(1.0f);
-  N_Client::setHeartbeatLatency(1.0f);
-  N_Server server(port());
-  server.setBandwidth(100000);
-  server.setMaximumBandwidthUsage(60000);
-  ServerPump pump(server);
-  const unsigned requests[] = {50000, 70000, 30000};
-  const unsigned expected[] = {35714, 42857, 21429};
   std::vector<std::unique_ptr<PeerProcess>> peers;
   std::vector<N_Client*> clients;
-  for (int i = 0; i < 3; ++i) {
-    auto options = heartbeat("1", "1");
-    options.insert(options.end(), {"--bandwidth", std::to_string(requests[i])});
-    peers.push_back(std::make_unique<PeerProcess>(2 + i, port(), options));
+  for (int i = 0; i < count; ++i) {
+    peers.push_back(std::make_unique<PeerProcess>(2 + i, port(), kSlowHeartbeat));
+    clients.push_back(peers.back()->admit(pump));
+    ASSERT_NE(nullptr, clients.back()) << peers.back()->host();
   }
+  pumpFor(300, pump);
+  EXPECT_EQ(std::size_t(count), pump.announced().size());
+  EXPECT_EQ(std::size_t(count), std::set<N_Client*>(clients.begin(), clients.end()).size());
+
   for (auto& peer : peers) {
-    clients.push_back(admit(*peer, pump));
-    ASSERT_NE(nullptr, clients.back()) << peer->host();
+    peer->command("send-r " + std::to_string(kPayloads) + " c 10");
+    peer->command("send-u " + std::to_string(kPayloads / 3) + " u 20");
   }
-  for (int i = 0; i < 3; ++i) {
-    EXPECT_TRUE(peers[i]->waitLine("bandwidth " + std::to_string(expected[i]), 5000, pump)) << i;
-    EXPECT_EQ(expected[i], clients[i]->getBandwidth());
+  std::map<N_Client*, std::vector<int>> reliable;
+  std::map<N_Client*, int> unreliable;
+  const Pump serve = [&] {
+    pump();
+    for (N_Client* client : clients) {
+      for (const std::string& p : readPayloads(*client, 1)) {
+        if (p[0] == 'u') ++unreliable[client];
+        if (p[0] != 'c') continue;
+        reliable[client].push_back(std::atoi(p.c_str() + 1));
+        std::string answer = "e" + p.substr(1) + ";";
+        client->queueReliable(answer.data(), static_cast<unsigned>(answer.size()), 0, 1);
+      }
+      client->flushReliable();
+    }
+  };
+  EXPECT_TRUE(waitFor(
+      [&] {
+        return std::all_of(clients.begin(), clients.end(),
+                           [&](N_Client* c) { return reliable[c].size() >= std::size_t(kPayloads); });
+      },
+      60000, serve));
+  std::vector<int> inOrder(kPayloads);
+  for (int k = 0; k < kPayloads; ++k) inOrder[k] = k;
+  int datagrams = 0;
+  for (int i = 0; i < count; ++i) {
+    EXPECT_EQ(inOrder, reliable[clients[i]]) << peers[i]->host();
+    EXPECT_TRUE(peers[i]->waitLine("e" + std::to_string(kPayloads - 1) + ";", 20000, serve)) << peers[i]->host();
+    auto latency = peers[i]->waitLine("latency", 5000, serve);
+    ASSERT_TRUE(latency) << peers[i]->host();
+    EXPECT_GT(valueOf(*latency), 0.0);
+    EXPECT_LT(valueOf(*latency), 1.0);
+    EXPECT_TRUE(waitFor([&] { return clients[i]->getLatency() > 0.0f; }, 5000, serve));
+    EXPECT_LT(clients[i]->getLatency(), 1.0f);
+    datagrams += unreliable[clients[i]];
   }
+  // Datagrams may be lost on a loaded machine, but the channel carries them.
+  EXPECT_GT(datagrams, 0);
+  EXPECT_LE(datagrams, count * (kPayloads / 3));
 
-  // Three clients at the default request, a budget of 10000 and the default
-  // cap: 3333 each, 9999 in all.
-  server.setBandwidth(10000);
-  server.setMaximumBandwidthUsage(10240);
-  for (auto& peer : peers) peer->command("bandwidth 1250000");
-  for (int i = 0; i < 3; ++i) {
-    EXPECT_TRUE(peers[i]->waitLine("bandwidth 3333", 5000, pump)) << i;
-    EXPECT_TRUE(waitFor([&] { return clients[i]->getBandwidth() == 3333; }, 2000, pump));
+  for (auto& peer : peers) EXPECT_TRUE(peer->quit(20000, pump)) << peer->host();
+  for (N_Client* client : clients) {
+    EXPECT_TRUE(waitFor([&] { return !client->isConnected(); }, 10000, pump));
+    server.disconnectClient(client);
   }
-
-  // One leaves: the other two get its part in that same call.
-  server.disconnectClient(clients[0]);
-  EXPECT_EQ(5000u, clients[1]->getBandwidth());
-  EXPECT_EQ(5000u, clients[2]->getBandwidth());
-  EXPECT_TRUE(peers[1]->waitLine("bandwidth 5000", 5000, pump));
-  EXPECT_TRUE(peers[2]->waitLine("bandwidth 5000", 5000, pump));
-  EXPECT_TRUE(peers[0]->waitLine("lost", 5000, pump));
+  EXPECT_EQ(0, ServerAccess::clientCount(server));
+  EXPECT_EQ(0, ServerAccess::pendingControlCount(server));
 }
 
+INSTANTIATE_TEST_SUITE_P(Count, ClientsTest, ::testing::Values(3, 20));
+
 TEST_F(ClientServerProcessTest, WorldTimerFollowsTheServer) {
-  // Slow heartbeats: the server stops answering below.
-  N_Client::setHeartbeatFrequency(5.0f);
-  N_Client::setHeartbeatLatency(5.0f);
+  heartbeat(5.0f, 5.0f);  // slow: the server stops answering below
   N_Server server(port());
   ServerPump pump(server);
-  PeerProcess peer(2, port(), heartbeat("5", "5"));
-  ASSERT_NE(nullptr, admit(peer, pump));
-
+  PeerProcess peer(2, port(), {"--hb-frequency", "5", "--hb-latency", "5"});
+  ASSERT_NE(nullptr, peer.admit(pump));
   peer.command("sync");
   auto sync = peer.waitLine("sync", 10000, pump);
   ASSERT_TRUE(sync);
@@ -160,65 +149,58 @@ TEST_F(ClientServerProcessTest, WorldTimerFollowsTheServer) {
   const double before = server.getWorldTimer().getAge();
   peer.command("time");
   auto time = peer.waitLine("time", 5000, pump);
-  const double after = server.getWorldTimer().getAge();
   ASSERT_TRUE(time);
-  const double world = valueOf(*time);
-  EXPECT_GE(world, before - took);
-  EXPECT_LE(world, after + took);
-
+  EXPECT_GE(valueOf(*time), before - took);
+  EXPECT_LE(valueOf(*time), server.getWorldTimer().getAge() + took);
   // No answers: false after the one second of the first exchange.
   peer.command("sync");
   sync = peer.waitLine("sync", 10000);
   ASSERT_TRUE(sync);
   EXPECT_EQ(0u, sync->find("sync 0 ")) << *sync;
-  const double failed = std::atof(sync->c_str() + 7);
-  EXPECT_GE(failed, 1.0);
-  EXPECT_LT(failed, 2.0);
+  EXPECT_GE(std::atof(sync->c_str() + 7), 1.0);
+  EXPECT_LT(std::atof(sync->c_str() + 7), 2.0);
 }
 
+// With the real timers: a client that stops calling update is dropped by the
+// server, and a server that stops calling update by its client.
 TEST_F(ClientServerProcessTest, SilentEndsAreDropped) {
+  heartbeat(0.2f, 0.2f);
   N_Server server(port());
   ServerPump pump(server);
-  // A client that stops calling update is dropped by the server...
-  PeerProcess a(2, port(), heartbeat("0.2", "0.2"));
-  N_Client* ca = admit(a, pump);
+  PeerProcess a(2, port(), {"--hb-frequency", "0.2", "--hb-latency", "0.2"});
+  N_Client* ca = a.admit(pump);
   ASSERT_NE(nullptr, ca);
   a.command("stall 2");
   EXPECT_TRUE(waitFor([&] { return !ca->isConnected(); }, 3000, pump));
   EXPECT_TRUE(a.waitLine("lost", 5000, pump));
   server.disconnectClient(ca);
   pump.forget(ca);
-
-  // ...and a server that stops calling update is dropped by its client.
-  PeerProcess b(3, port(), heartbeat("0.2", "0.2"));
-  N_Client* cb = admit(b, pump);
+  PeerProcess b(3, port(), {"--hb-frequency", "0.2", "--hb-latency", "0.2"});
+  N_Client* cb = b.admit(pump);
   ASSERT_NE(nullptr, cb);
   EXPECT_TRUE(b.waitLine("lost", 5000));
   EXPECT_TRUE(waitFor([&] { return !cb->isConnected(); }, 3000, pump));
 }
 
 TEST_F(ClientServerProcessTest, SimulatedLossTakesUnreliableMessagesOnly) {
-  N_Client::setHeartbeatFrequency(1.0f);
-  N_Client::setHeartbeatLatency(1.0f);
   N_Server server(port());
   ServerPump pump(server);
-  PeerProcess peer(2, port(), heartbeat("1", "1"));
-  N_Client* client = admit(peer, pump);
+  PeerProcess peer(2, port(), kSlowHeartbeat);
+  N_Client* client = peer.admit(pump);
   ASSERT_NE(nullptr, client);
-
-  // Everything unreliable is lost, nothing reliable.
+  // Everything unreliable is lost, nothing reliable, and thrown away rather
+  // than left waiting.
   N_Client::simulatePacketLoss(1.0f);
   peer.command("send-u 30 u 5");
   ASSERT_TRUE(peer.waitLine("sent 30", 10000, pump));
   peer.command("send-r 30 r 5");
   ASSERT_TRUE(peer.waitLine("sent 30", 10000, pump));
   pumpFor(300, pump);
-  std::vector<std::string> got = readPayloads(*client);
-  std::vector<int> reliable = indicesOf(got, 'r');
-  ASSERT_EQ(30u, reliable.size());
-  for (int i = 0; i < 30; ++i) EXPECT_EQ(i, reliable[i]);
+  const std::vector<std::string> got = readPayloads(*client);
+  std::vector<int> thirty(30);
+  for (int i = 0; i < 30; ++i) thirty[i] = i;
+  EXPECT_EQ(thirty, indicesOf(got, 'r'));
   EXPECT_TRUE(indicesOf(got, 'u').empty());
-  // Thrown away, not left waiting.
   N_Client::simulatePacketLoss(0.0f);
   EXPECT_TRUE(readPayloads(*client).empty());
 
@@ -234,26 +216,19 @@ TEST_F(ClientServerProcessTest, SimulatedLossTakesUnreliableMessagesOnly) {
     kept[round] = indicesOf(readPayloads(*client), prefix);
   }
   EXPECT_EQ(kept[0], kept[1]);
-  EXPECT_GT(kept[0].size(), 0u) << [&] {
-    std::string all;
-    for (const std::string& line : peer.process().lines()) all += line.substr(0, 60) + "\n";
-    return all;
-  }();
+  EXPECT_GT(kept[0].size(), 0u);
   EXPECT_LT(kept[0].size(), 40u);
   EXPECT_TRUE(std::is_sorted(kept[0].begin(), kept[0].end()));
   EXPECT_TRUE(peer.quit(10000, pump));
 }
 
 TEST_F(ClientServerProcessTest, UnreliableBatchesStayBelowTheDatagramLimit) {
-  N_Client::setHeartbeatFrequency(1.0f);
-  N_Client::setHeartbeatLatency(1.0f);
   N_Server server(port());
-  // Room for the default request: a budget far above one datagram.
-  server.setBandwidth(4000000);
+  server.setBandwidth(4000000);  // room for the default request
   server.setMaximumBandwidthUsage(2000000);
   ServerPump pump(server);
-  PeerProcess peer(2, port(), heartbeat("1", "1"));
-  N_Client* client = admit(peer, pump);
+  PeerProcess peer(2, port(), kSlowHeartbeat);
+  N_Client* client = peer.admit(pump);
   ASSERT_NE(nullptr, client);
   ASSERT_TRUE(peer.waitLine("bandwidth 1250000", 5000, pump));
   peer.command("limits");
@@ -262,11 +237,10 @@ TEST_F(ClientServerProcessTest, UnreliableBatchesStayBelowTheDatagramLimit) {
   const unsigned largest = static_cast<unsigned>(valueOf(*limits));
   ASSERT_GT(largest, 200u);
   EXPECT_EQ(largest, client->getLargestUnreliablePacketSize());
-
-  auto nextDatagram = [&]() -> std::optional<std::string> {
+  auto nextDatagram = [&] {
     void* m = nullptr;
     unsigned n = 0;
-    if (!waitFor([&] { return client->poll(m, n); }, 5000, pump)) return std::nullopt;
+    if (!waitFor([&] { return client->poll(m, n); }, 5000, pump)) return std::string("<none>");
     return std::string(static_cast<const char*>(m), n);
   };
   // 9 and 5 would make exactly the limit: 5 waits, 1 fills up to one below.
@@ -274,23 +248,15 @@ TEST_F(ClientServerProcessTest, UnreliableBatchesStayBelowTheDatagramLimit) {
   peer.command("qun 0 5 100 b");
   peer.command("qun 0 1 99 c");
   peer.command("fu");
-  ASSERT_TRUE(peer.waitLine("flushed", 5000, pump));
-  auto first = nextDatagram();
-  ASSERT_TRUE(first);
-  EXPECT_EQ(std::string(largest - 100, 'a') + std::string(99, 'c'), *first);
+  EXPECT_EQ(std::string(largest - 100, 'a') + std::string(99, 'c'), nextDatagram());
   pumpFor(150, pump);
   peer.command("fu");
-  auto second = nextDatagram();
-  ASSERT_TRUE(second);
-  EXPECT_EQ(std::string(100, 'b'), *second);
-
+  EXPECT_EQ(std::string(100, 'b'), nextDatagram());
   // A single payload of exactly the limit goes.
   pumpFor(150, pump);
   peer.command("qun 0 1 " + std::to_string(largest) + " d");
   peer.command("fu");
-  auto third = nextDatagram();
-  ASSERT_TRUE(third);
-  EXPECT_EQ(largest, third->size());
+  EXPECT_EQ(largest, nextDatagram().size());
   EXPECT_TRUE(peer.quit(10000, pump));
 }
 

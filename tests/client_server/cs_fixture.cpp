@@ -2,77 +2,46 @@
 
 #include <cstdlib>
 
-#include "fault.h"
-#include "free_port.h"
-#include "vardel_platform.h"
 
 namespace cs_test {
 
-bool waitFor(const std::function<bool()>& done, int milliseconds, const Pump& pump) {
-  auto deadline = Clock::now() + std::chrono::milliseconds(milliseconds);
-  for (;;) {
-    if (pump) pump();
-    if (done()) return true;
-    if (Clock::now() > deadline) return false;
-    std::this_thread::sleep_for(std::chrono::microseconds(500));
-  }
-}
-
-void pumpFor(int milliseconds, const Pump& pump) {
-  auto deadline = Clock::now() + std::chrono::milliseconds(milliseconds);
-  while (Clock::now() < deadline) {
-    if (pump) pump();
-    std::this_thread::sleep_for(std::chrono::microseconds(500));
-  }
-}
-
 void sleepMs(int milliseconds) { std::this_thread::sleep_for(std::chrono::milliseconds(milliseconds)); }
 
-double secondsSince(Clock::time_point start) {
-  return std::chrono::duration<double>(Clock::now() - start).count();
-}
-
 std::vector<unsigned char> controlBytes(std::uint32_t type, std::uint32_t value, int size) {
-  ControlMessage message{type, value};
   unsigned char bytes[8] = {};
-  message.encode(bytes);
-  // Fill the value word even for 4-byte types, so a cut or padded message
-  // carries recognisable bytes.
-  bytes[4] = static_cast<unsigned char>(value);
-  bytes[5] = static_cast<unsigned char>(value >> 8);
-  bytes[6] = static_cast<unsigned char>(value >> 16);
-  bytes[7] = static_cast<unsigned char>(value >> 24);
-  unsigned n = size >= 0 ? static_cast<unsigned>(size) : ControlMessage::sizeOf(type);
+  ControlMessage{type, value}.encode(bytes);
+  for (int i = 0; i < 4; ++i) bytes[4 + i] = static_cast<unsigned char>(value >> (8 * i));
+  const unsigned n = size >= 0 ? static_cast<unsigned>(size) : ControlMessage::sizeOf(type);
   return std::vector<unsigned char>(bytes, bytes + n);
 }
 
+std::string hostOf(const N_Client* client) {
+  const volatile char* number = client->getAddress()->getStringNumber();
+  return number != nullptr ? const_cast<const char*>(number) : "";
+}
+
+static Received parse(const void* message, unsigned size, Clock::time_point start) {
+  const auto* b = static_cast<const unsigned char*>(message);
+  auto word = [&](int at) { return b[at] | b[at + 1] << 8 | b[at + 2] << 16 | std::uint32_t{b[at + 3]} << 24; };
+  return {size, size >= 4 ? word(0) : 0, size >= 8 ? word(4) : 0, secondsSince(start)};
+}
+
+void ClientServerTest::heartbeat(float frequency, float latency) {
+  N_Client::setHeartbeatFrequency(frequency);
+  N_Client::setHeartbeatLatency(latency);
+}
+
 void ClientServerTest::SetUp() {
-  platform::fault::disarmAll();
-  platform::setLocalHost("127.0.0.1");
-  N_Client::setHeartbeatFrequency(0.2f);
-  N_Client::setHeartbeatLatency(0.2f);
-  N_Client::simulateLatency(0, 0);
-  N_Client::simulatePacketLoss(0.0f);
-  N_Client::simulateNetwork(N_NetworkModel{});
-  m_balance = std::make_unique<AllocationBalance>();
-  m_runtime = std::make_unique<N_Initializer>();
-  m_loopback = std::make_unique<N_Address>("127.0.0.1");
-  m_iPort = pickFreePort(true);
-  ASSERT_GT(m_iPort, 0);
+  RuntimeTest::SetUp();
+  heartbeat(0.2f, 0.2f);
 }
 
 void ClientServerTest::TearDown() {
-  platform::fault::disarmAll();
-  m_loopback.reset();
-  m_runtime.reset();
-  N_Client::setHeartbeatFrequency(4.0f);
-  N_Client::setHeartbeatLatency(2.0f);
+  heartbeat(4.0f, 2.0f);
   N_Client::simulateLatency(0, 0);
   N_Client::simulatePacketLoss(0.0f);
   N_Client::simulateNetwork(N_NetworkModel{});
-  const bool settled = waitFor([&] { return m_balance->outstanding() == m_iRefused; }, 10000);
-  EXPECT_TRUE(settled) << "library allocations outstanding: " << m_balance->outstanding() << ", refused by faults: "
-                       << m_iRefused;
+  RuntimeTest::TearDown();
 }
 
 // ---------------------------------------------------------------------------
@@ -90,6 +59,10 @@ ScriptedServer::~ScriptedServer() {
 }
 
 void ScriptedServer::run() {
+  auto reply = [&](std::uint32_t type, std::uint32_t value = 0) {
+    auto bytes = controlBytes(type, value);
+    m_pControl->send(bytes.data(), static_cast<unsigned>(bytes.size()));
+  };
   while (!m_bStop) {
     {
       std::lock_guard<std::mutex> hold(m_lock);
@@ -99,27 +72,14 @@ void ScriptedServer::run() {
       void* message = nullptr;
       unsigned size = 0;
       while (m_pControl != nullptr && m_pControl->poll(message, size)) {
-        const auto* b = static_cast<const unsigned char*>(message);
-        Received r{size, 0, 0, secondsSince(m_start)};
-        if (size >= 4) r.type = b[0] | b[1] << 8 | b[2] << 16 | static_cast<std::uint32_t>(b[3]) << 24;
-        if (size >= 8) r.value = b[4] | b[5] << 8 | b[6] << 16 | static_cast<std::uint32_t>(b[7]) << 24;
+        const Received r = parse(message, size, m_start);
         m_control.push_back(r);
-        if (r.type == ControlMessage::CONTROL_HEARTBEAT && answerHeartbeats) {
-          auto reply = controlBytes(ControlMessage::CONTROL_HEARTBEAT_REPLY);
-          m_pControl->send(reply.data(), static_cast<unsigned>(reply.size()));
-        }
-        if (r.type == ControlMessage::CONTROL_WORLD_TIME_REQUEST) {
-          int left = worldTimeAnswers.load();
-          if (left != 0) {
-            if (left > 0) worldTimeAnswers = left - 1;
-            auto reply =
-                controlBytes(ControlMessage::CONTROL_WORLD_TIME, ControlMessage::floatBits(worldTimeValue.load()));
-            m_pControl->send(reply.data(), static_cast<unsigned>(reply.size()));
-          }
+        if (r.type == CM::CONTROL_HEARTBEAT && answerHeartbeats) reply(CM::CONTROL_HEARTBEAT_REPLY);
+        if (r.type == CM::CONTROL_WORLD_TIME_REQUEST && worldTimeAnswers != 0) {
+          if (worldTimeAnswers > 0) --worldTimeAnswers;
+          reply(CM::CONTROL_WORLD_TIME, CM::floatBits(worldTimeValue.load()));
         }
       }
-      while (m_pData != nullptr && m_pData->poll(message, size))
-        m_dataMessages.emplace_back(static_cast<const char*>(message), size);
     }
     std::this_thread::sleep_for(std::chrono::microseconds(200));
   }
@@ -130,19 +90,15 @@ std::vector<Received> ScriptedServer::control() {
   return m_control;
 }
 
-std::vector<std::string> ScriptedServer::data() {
+std::size_t ScriptedServer::count(std::uint32_t type) {
   std::lock_guard<std::mutex> hold(m_lock);
-  return m_dataMessages;
+  return std::count_if(m_control.begin(), m_control.end(), [&](const Received& r) { return r.type == type; });
 }
 
-bool ScriptedServer::controlConnected() {
+bool ScriptedServer::connected(bool control) {
   std::lock_guard<std::mutex> hold(m_lock);
-  return m_pControl != nullptr && m_pControl->isConnected();
-}
-
-bool ScriptedServer::dataConnected() {
-  std::lock_guard<std::mutex> hold(m_lock);
-  return m_pData != nullptr && m_pData->isConnected();
+  N_Socket* s = control ? m_pControl : m_pData;
+  return s != nullptr && s->isConnected();
 }
 
 bool ScriptedServer::sendControl(const std::vector<unsigned char>& bytes) {
@@ -161,10 +117,6 @@ bool ScriptedServer::sendData(const std::string& bytes) {
 
 bool ScriptedServer::waitControl(std::size_t count, int milliseconds, const Pump& pump) {
   return waitFor([&] { return control().size() >= count; }, milliseconds, pump);
-}
-
-bool ScriptedServer::waitData(std::size_t count, int milliseconds, const Pump& pump) {
-  return waitFor([&] { return data().size() >= count; }, milliseconds, pump);
 }
 
 void ScriptedServer::hangUp() {
@@ -200,8 +152,6 @@ bool ScriptedClient::connected() {
   return m_pData != nullptr && m_pData->isConnected() && m_pControl != nullptr && m_pControl->isConnected();
 }
 
-void ScriptedClient::send(std::uint32_t type, std::uint32_t value) { sendRaw(controlBytes(type, value)); }
-
 void ScriptedClient::sendRaw(const std::vector<unsigned char>& bytes) {
   m_pControl->send(const_cast<unsigned char*>(bytes.data()), static_cast<unsigned>(bytes.size()));
 }
@@ -210,39 +160,56 @@ std::optional<Received> ScriptedClient::next(int milliseconds, const Pump& pump)
   void* message = nullptr;
   unsigned size = 0;
   if (!waitFor([&] { return m_pControl->poll(message, size); }, milliseconds, pump)) return std::nullopt;
-  const auto* b = static_cast<const unsigned char*>(message);
-  Received r{size, 0, 0, secondsSince(m_start)};
-  if (size >= 4) r.type = b[0] | b[1] << 8 | b[2] << 16 | static_cast<std::uint32_t>(b[3]) << 24;
-  if (size >= 8) r.value = b[4] | b[5] << 8 | b[6] << 16 | static_cast<std::uint32_t>(b[7]) << 24;
-  return r;
+  return parse(message, size, m_start);
 }
 
 std::vector<Received> ScriptedClient::drain(int milliseconds, const Pump& pump) {
   std::vector<Received> out;
-  auto deadline = Clock::now() + std::chrono::milliseconds(milliseconds);
-  while (Clock::now() < deadline) {
-    auto r = next(1, pump);
-    if (r) out.push_back(*r);
-  }
+  const auto deadline = Clock::now() + std::chrono::milliseconds(milliseconds);
+  while (Clock::now() < deadline)
+    if (auto r = next(1, pump)) out.push_back(*r);
   return out;
+}
+
+std::optional<std::uint32_t> ScriptedClient::lastGrant(const Pump& pump, int milliseconds) {
+  std::optional<std::uint32_t> grant;
+  for (const Received& r : drain(milliseconds, pump))
+    if (r.type == CM::CONTROL_BANDWIDTH_GRANT && r.size == 8) grant = r.value;
+  return grant;
 }
 
 // ---------------------------------------------------------------------------
 
+N_Client* ServerPump::clientOf(const std::string& host, int milliseconds) const {
+  N_Client* found = nullptr;
+  waitFor(
+      [&] {
+        for (N_Client* c : announced())
+          if (hostOf(c) == host) found = c;
+        return found != nullptr;
+      },
+      milliseconds, *this);
+  return found;
+}
+
+N_Client* pairUp(const ServerPump& pump, ScriptedClient& client) {
+  const std::size_t before = pump.announced().size();
+  if (!waitFor([&] { return pump.announced().size() > before && client.connected(); }, 5000, pump)) {
+    ADD_FAILURE() << "not paired: announced " << pump.announced().size() << " (before " << before << ")";
+    return nullptr;
+  }
+  return pump.announced().back();
+}
+
 PeerProcess::PeerProcess(int hostNumber, int port, std::vector<std::string> extra)
-    : m_host("127.0.0." + std::to_string(hostNumber)),
-      m_process(VARDEL_HOST_CLIENT_PEER, [&] {
-        std::vector<std::string> args = {"--host",      "127.0.0." + std::to_string(hostNumber),
-                                         "--server",    "127.0.0.1",
-                                         "--port",      std::to_string(port)};
+    : m_host("127.0.0." + std::to_string(hostNumber)), m_process(VARDEL_HOST_CLIENT_PEER, [&] {
+        std::vector<std::string> args = {"--host", m_host, "--server", "127.0.0.1", "--port", std::to_string(port)};
         args.insert(args.end(), extra.begin(), extra.end());
         return args;
       }()) {}
 
-PeerProcess::~PeerProcess() = default;
-
 std::optional<std::string> PeerProcess::waitLine(std::string_view text, int milliseconds, const Pump& pump) {
-  auto deadline = Clock::now() + std::chrono::milliseconds(milliseconds);
+  const auto deadline = Clock::now() + std::chrono::milliseconds(milliseconds);
   while (Clock::now() < deadline) {
     if (pump) pump();
     std::optional<std::string> line = m_process.readLine(1);
@@ -251,23 +218,23 @@ std::optional<std::string> PeerProcess::waitLine(std::string_view text, int mill
   return std::nullopt;
 }
 
-std::vector<std::string> PeerProcess::linesStartingWith(std::string_view prefix) const {
-  std::vector<std::string> out;
-  for (const std::string& line : m_process.lines())
-    if (line.compare(0, prefix.size(), prefix) == 0) out.push_back(line);
-  return out;
-}
-
 bool PeerProcess::quit(int milliseconds, const Pump& pump) {
-  if (!command("quit")) return false;
-  if (!waitLine("bye", milliseconds, pump)) return false;
+  if (!command("quit") || !waitLine("bye", milliseconds, pump)) return false;
   std::optional<int> code;
   waitFor([&] { return (code = m_process.wait(0)).has_value(); }, milliseconds, pump);
   return code && *code == 0;
 }
 
+N_Client* PeerProcess::admit(const ServerPump& pump) {
+  if (waitLine("connected", 20000, pump)) return pump.clientOf(m_host);
+  std::string said;
+  for (const std::string& line : m_process.lines()) said += "\n  " + line;
+  ADD_FAILURE() << m_host << " did not connect; it said:" << said;
+  return nullptr;
+}
+
 double valueOf(const std::string& line) {
-  std::size_t space = line.find(' ');
+  const std::size_t space = line.find(' ');
   return space == std::string::npos ? 0.0 : std::strtod(line.c_str() + space + 1, nullptr);
 }
 

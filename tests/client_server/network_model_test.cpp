@@ -66,29 +66,26 @@ std::vector<double> reliableDelays(const N_NetworkModel& m, int count) {
   return out;
 }
 
+N_NetworkModel modelOf(float delay, float jitter, float loss, float duplicate, float reorder, float window,
+                       unsigned seed) {
+  N_NetworkModel m;
+  m.fDelay = delay;
+  m.fJitter = jitter;
+  m.fLoss = loss;
+  m.fDuplicate = duplicate;
+  m.fReorder = reorder;
+  m.fReorderWindow = window;
+  m.uSeed = seed;
+  return m;
+}
+
 class NetworkModelTest : public ClientServerTest {
  protected:
   void SetUp() override {
     ClientServerTest::SetUp();
-    N_Client::setHeartbeatFrequency(1.0f);
-    N_Client::setHeartbeatLatency(1.0f);
+    heartbeat(1.0f, 1.0f);
   }
   static std::vector<std::string> peerOptions() { return {"--hb-frequency", "1", "--hb-latency", "1"}; }
-
-  static N_Client* admit(PeerProcess& peer, const ServerPump& pump) {
-    if (!peer.waitLine("connected", 20000, pump)) return nullptr;
-    N_Client* client = nullptr;
-    waitFor(
-        [&] {
-          for (N_Client* c : pump.announced()) {
-            const volatile char* number = c->getAddress()->getStringNumber();
-            if (number != nullptr && peer.host() == const_cast<const char*>(number)) client = c;
-          }
-          return client != nullptr;
-        },
-        5000, pump);
-    return client;
-  }
 
   // Reads everything the client hands out now; payloads "<prefix><i>@<ns>;".
   static void readAll(N_Client& client, const std::string& prefix, std::vector<Delivery>& out) {
@@ -116,19 +113,12 @@ TEST_F(NetworkModelTest, UnreliableStreamIsLostCopiedReorderedAndDelayedAsTheSee
   N_Server server(port());
   ServerPump pump(server);
   PeerProcess a(2, port(), peerOptions()), b(3, port(), peerOptions());
-  N_Client* clients[2] = {admit(a, pump), admit(b, pump)};
+  N_Client* clients[2] = {a.admit(pump), b.admit(pump)};
   ASSERT_NE(nullptr, clients[0]);
   ASSERT_NE(nullptr, clients[1]);
   EXPECT_EQ(0u, clients[0]->getSimulationStats().uReceived) << "off until set";
 
-  N_NetworkModel model;
-  model.fDelay = 40;
-  model.fJitter = 20;
-  model.fLoss = 0.25f;
-  model.fDuplicate = 0.1f;
-  model.fReorder = 0.1f;
-  model.fReorderWindow = 50;
-  model.uSeed = 20240;
+  const N_NetworkModel model = modelOf(40, 20, 0.25f, 0.1f, 0.1f, 50, 20240);
   N_Client::simulateNetwork(model);
   EXPECT_EQ(20240u, N_Client::getNetworkModel().uSeed);
 
@@ -241,18 +231,11 @@ TEST_F(NetworkModelTest, ReliableMessagesAreOnlyDelayedAndNeverOvertakeEachOther
   N_Server server(port());
   ServerPump pump(server);
   PeerProcess peer(2, port(), peerOptions());
-  N_Client* client = admit(peer, pump);
+  N_Client* client = peer.admit(pump);
   ASSERT_NE(nullptr, client);
 
   // Everything that could happen to an unreliable message is set to happen.
-  N_NetworkModel model;
-  model.fDelay = 30;
-  model.fJitter = 25;
-  model.fLoss = 1.0f;
-  model.fDuplicate = 1.0f;
-  model.fReorder = 1.0f;
-  model.fReorderWindow = 100;
-  model.uSeed = 99;
+  const N_NetworkModel model = modelOf(30, 25, 1.0f, 1.0f, 1.0f, 100, 99);
   N_Client::simulateNetwork(model);
 
   constexpr int kCount = 100;
@@ -292,7 +275,7 @@ TEST_F(NetworkModelTest, TheCapPassesItsRateAndTheQueueLimitHolds) {
   N_Server server(port());
   ServerPump pump(server);
   PeerProcess peer(2, port(), peerOptions());
-  N_Client* client = admit(peer, pump);
+  N_Client* client = peer.admit(pump);
   ASSERT_NE(nullptr, client);
 
   constexpr unsigned kCap = 2000;

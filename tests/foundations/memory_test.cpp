@@ -1,146 +1,127 @@
-// Counted allocation: Q_Memory's raw blocks and the object helpers, with
-// injected allocation faults and allocation from several threads.
+// Counted allocation (blocks, objects, arrays, injected faults) and the one
+// container built on it, Q_DLList.
 #include <gtest/gtest.h>
 
 #include <cstddef>
 #include <cstdint>
-#include <cstring>
-#include <latch>
+#include <functional>
 #include <stdexcept>
-#include <thread>
 #include <vector>
 
 #include "N_Exceptions.h"
-#include "Q_Memory.h"
+#include "Q_DLList.h"
 #include "Q_New.h"
-#include "fault.h"
+#include "allocation_balance.h"
+#include "fault_guard.h"
 
 namespace {
 
-struct Counts {
-  int news = Q_Memory::sm_iNewCount.load();
-  int deletes = Q_Memory::sm_iDeleteCount.load();
-  int newsSince() const { return Q_Memory::sm_iNewCount.load() - news; }
-  int deletesSince() const { return Q_Memory::sm_iDeleteCount.load() - deletes; }
-};
-
-// Runs `f` and gives the text of the allocation failure it threw, or null.
-template <class F>
-const char* allocationFailure(F f) {
-  try {
-    f();
-  } catch (Q_MemoryException_Allocation* e) {
-    return e->getErrorMessage();
-  }
-  return nullptr;
-}
-
 struct Widget {
   static inline int constructed = 0;
-  int a;
-  int b;
+  int a, b;
   Widget(int x, int y) : a(x), b(y) { ++constructed; }
 };
 
-struct Refuses {
-  explicit Refuses(bool refuse) {
-    if (refuse) throw std::runtime_error("refused");
-  }
-};
+using IntList = Q_DLList<int>;
 
-class FaultReset : public testing::Test {
- protected:
-  void TearDown() override { platform::fault::disarmAll(); }
-};
+std::vector<int> walk(IntList& list) {
+  std::vector<int> values;
+  for (int* p = list.getFirst(); p != nullptr; p = list.getNext(p)) values.push_back(*p);
+  return values;
+}
 
 }  // namespace
 
-using QMemoryBlocks = FaultReset;
-using QMemoryObjects = FaultReset;
-
-TEST_F(QMemoryBlocks, AllocateAndReleaseAreCountedAndUsable) {
-  Counts counts;
-  void* p = Q_Memory::allocate(100);
-  ASSERT_NE(nullptr, p);
-  std::memset(p, 0x5a, 100);
-  EXPECT_EQ(0u, reinterpret_cast<std::uintptr_t>(p) % alignof(std::max_align_t));
-  EXPECT_EQ(1, counts.newsSince());
-  EXPECT_EQ(0, counts.deletesSince());
-  Q_Memory::release(p);
-  Q_Memory::release(nullptr);
-  EXPECT_EQ(1, counts.newsSince());
-  EXPECT_EQ(1, counts.deletesSince()) << "releasing null counts nothing";
-}
-
-TEST_F(QMemoryBlocks, AnInjectedFaultThrowsAndStillCounts) {
-  Counts counts;
-  platform::fault::failAllocation(2);
-  void* first = Q_Memory::allocate(8);
-  EXPECT_STREQ("Out of system memory resources", allocationFailure([] { Q_Memory::allocate(8); }));
-  void* third = Q_Memory::allocate(8);
-  EXPECT_EQ(1, platform::fault::allocationsFailed());
-  EXPECT_EQ(3, counts.newsSince());
-  Q_Memory::release(first);
-  Q_Memory::release(third);
-  EXPECT_EQ(2, counts.deletesSince());
-}
-
-TEST_F(QMemoryBlocks, CountersStayExactWithManyThreads) {
-  constexpr int kThreads = 6;
-  constexpr int kBlocks = 5000;
-  Counts counts;
-  std::latch start(kThreads);
-  std::vector<std::thread> threads;
-  for (int t = 0; t < kThreads; ++t) {
-    threads.emplace_back([&] {
-      start.arrive_and_wait();
-      for (int i = 0; i < kBlocks; ++i) {
-        void* p = Q_Memory::allocate(16);
-        Q_Memory::release(p);
-      }
-    });
-  }
-  for (std::thread& t : threads) t.join();
-  EXPECT_EQ(kThreads * kBlocks, counts.newsSince());
-  EXPECT_EQ(kThreads * kBlocks, counts.deletesSince());
-}
-
-TEST_F(QMemoryObjects, NewAndDeleteAreCounted) {
-  Counts counts;
+TEST(QMemory, EachAllocationCountsOnceAndEachReleaseOnce) {
+  AllocationBalance balance;
+  void* block = Q_Memory::allocate(100);
+  EXPECT_EQ(0u, reinterpret_cast<std::uintptr_t>(block) % alignof(std::max_align_t));
   Widget* w = Q_New<Widget>(3, 4);
-  EXPECT_EQ(3, w->a);
-  EXPECT_EQ(4, w->b);
-  EXPECT_EQ(1, counts.newsSince());
-  Q_Delete(w);
-  Q_Delete<Widget>(nullptr);
-  EXPECT_EQ(1, counts.deletesSince());
-
+  EXPECT_TRUE(w->a == 3 && w->b == 4);
   int* array = Q_NewArray<int>(64);
-  for (int i = 0; i < 64; ++i) array[i] = i;
-  EXPECT_EQ(63, array[63]);
-  EXPECT_EQ(2, counts.newsSince());
+  array[63] = 63;
+  EXPECT_EQ(3, balance.outstanding());
+  Q_Memory::release(block);
+  Q_Delete(w);
   Q_DeleteArray(array);
+  Q_Memory::release(nullptr);
+  Q_Delete<Widget>(nullptr);
   Q_DeleteArray<int>(nullptr);
-  EXPECT_EQ(2, counts.deletesSince());
+  EXPECT_THROW(Q_New<std::vector<int>>(std::size_t{1} << 62), std::length_error);
+  EXPECT_EQ(0, balance.outstanding()) << "null releases and a throwing constructor count nothing";
 }
 
-TEST_F(QMemoryObjects, AFaultThrowsBeforeAnyConstructorRuns) {
-  Counts counts;
-  int constructedBefore = Widget::constructed;
-  platform::fault::failAllocation(1);
-  EXPECT_STREQ("Out of system memory resources", allocationFailure([] { Q_New<Widget>(1, 2); }));
-  EXPECT_EQ(constructedBefore, Widget::constructed);
-  platform::fault::failAllocation(1);
-  EXPECT_STREQ("Out of system memory resources", allocationFailure([] { Q_NewArray<char>(10); }));
-  EXPECT_EQ(2, counts.newsSince());
-  EXPECT_EQ(0, counts.deletesSince());
+TEST(QMemory, AnInjectedFaultThrowsBeforeAnyConstructorAndIsCounted) {
+  AllocationBalance balance;
+  FaultGuard faults;
+  for (const std::function<void()>& allocate : std::vector<std::function<void()>>{
+           [] { Q_Memory::allocate(8); }, [] { Q_New<Widget>(1, 2); }, [] { Q_NewArray<char>(10); }}) {
+    faults.failAllocation(1);
+    try {
+      allocate();
+      ADD_FAILURE() << "an allocation gave memory it was told not to";
+    } catch (Q_MemoryException_Allocation* e) {
+      EXPECT_STREQ("Out of system memory resources", e->getErrorMessage());
+    }
+  }
+  EXPECT_EQ(0, Widget::constructed);
+  EXPECT_EQ(3, balance.outstanding()) << "a refused allocation counts as made";
 }
 
-TEST_F(QMemoryObjects, AThrowingConstructorPassesItsExceptionAndCountsNothing) {
-  Counts counts;
-  EXPECT_THROW(Q_New<Refuses>(true), std::runtime_error);
-  EXPECT_EQ(0, counts.newsSince());
-  Q_Delete(Q_New<Refuses>(false));
-  EXPECT_EQ(1, counts.newsSince());
-  EXPECT_EQ(1, counts.deletesSince());
+TEST(QDLList, KeepsOrderAndAddressesThroughRemovalsAndFreesEverything) {
+  AllocationBalance balance;
+  {
+    IntList list;
+    EXPECT_EQ(nullptr, list.getFirst());
+    std::vector<int*> at;
+    for (int i = 0; i < 5; ++i) *at.emplace_back(list.append()) = i;
+    EXPECT_EQ(5, balance.outstanding()) << "one counted block per node";
+    for (int i : {2, 0, 4}) list.remove(at[i]);
+    EXPECT_EQ((std::vector<int>{1, 3}), walk(list));
+    EXPECT_EQ(at[3], list.getNext(at[1])) << "the others stay where they were";
+    EXPECT_EQ(2, list.m_iCount);
+    for (int i : {3, 1}) list.remove(at[i]);
+    EXPECT_EQ(nullptr, list.getFirst());
+    EXPECT_EQ(nullptr, list.getAt(0));
+    for (int i : {7, 8}) *list.append() = i;
+    EXPECT_EQ((std::vector<int>{7, 8}), walk(list)) << "an emptied list is usable again";
+    list.m_pSpareA = Q_Memory::allocate(32);
+    list.m_pSpareB = Q_Memory::allocate(8);
+  }
+  EXPECT_EQ(0, balance.outstanding()) << "the destructor frees the nodes left and both spare blocks";
+}
+
+TEST(QDLList, GetAtAnyOrderMissesKeepTheCacheAndChangesDropIt) {
+  IntList list;
+  for (int i = 0; i < 10; ++i) *list.append() = i;
+  for (int i : {0, 1, 2, 3, 4, 5, 6, 7, 8, 9, 9, 8, 7, 6, 5, 4, 3, 2, 1, 0, 5, 0, 9, 3, 3, 8, 1, 6}) {
+    ASSERT_NE(nullptr, list.getAt(i));
+    EXPECT_EQ(i, *list.getAt(i));
+    EXPECT_EQ(i, list.m_iCacheIndex) << "the cache stays on the element given";
+  }
+  int* six = list.getAt(6);
+  for (int outside : {-1, 10, IntList::kInvalidCacheIndex}) EXPECT_EQ(nullptr, list.getAt(outside));
+  EXPECT_EQ(six, list.m_pCacheData) << "a miss keeps the cache";
+  *list.append() = 10;
+  EXPECT_EQ(IntList::kInvalidCacheIndex, list.m_iCacheIndex);
+  EXPECT_EQ(2, *list.getAt(2));
+  list.remove(list.getFirst());
+  EXPECT_EQ(IntList::kInvalidCacheIndex, list.m_iCacheIndex);
+  EXPECT_EQ(3, *list.getAt(2)) << "index 2 is another element now";
+  EXPECT_EQ(10, *list.getAt(9));
+}
+
+TEST(QDLList, AFailedAppendThrowsAndLeavesTheListAsItWas) {
+  IntList list;
+  for (int i : {0, 1}) *list.append() = i;
+  AllocationBalance balance;
+  {
+    FaultGuard faults;
+    faults.failAllocation(1);
+    EXPECT_THROW(list.append(), Q_MemoryException_Allocation*);
+  }
+  EXPECT_EQ(1, balance.outstanding()) << "the refused allocation is counted, nothing else";
+  EXPECT_EQ(2, list.m_iCount);
+  *list.append() = 2;
+  EXPECT_EQ((std::vector<int>{0, 1, 2}), walk(list));
 }

@@ -4,11 +4,9 @@
 //   vardel_host_hostile_peer --host A --server 127.0.0.1 --port P
 //       --attack NAME --seconds S
 //
-// Attacks: scan, drip, half-open, truncated, connect-flood, giant-prefix,
-// small-messages, echo-flood, bandwidth-flood, no-read, descriptors (see
-// each function). Those that open many connections spread them over
-// kSpread addresses from A up, as many machines would; those that pair like
-// a client use A alone. Prints, one per line:
+// Attacks: see kAttacks below. Those that open many connections spread them
+// over kSpread addresses from A up, as many machines would; those that pair
+// like a client use A alone. Prints, one per line:
 //   attacking                started
 //   paired                   the server answered our heartbeat (paired attacks)
 //   closed-by-server T       the server cut a paired attacker off after T s
@@ -29,6 +27,8 @@
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
+#include <functional>
+#include <map>
 #include <string>
 #include <thread>
 #include <vector>
@@ -41,41 +41,34 @@ using Bytes = std::vector<unsigned char>;
 constexpr int kControlPort = 6000;
 constexpr int kSpread = 12;
 
-std::string g_host = "127.0.0.10";
-std::string g_server = "127.0.0.1";
+std::string g_host = "127.0.0.10", g_server = "127.0.0.1";
 int g_port = 3123;
-Clock::time_point g_start;
-Clock::time_point g_end;
+Clock::time_point g_start, g_end;
 
 void say(const std::string& line) {
   std::fputs((line + "\n").c_str(), stdout);
   std::fflush(stdout);
 }
-
 bool timeUp() { return Clock::now() >= g_end; }
 void sleepMs(int ms) { std::this_thread::sleep_for(std::chrono::milliseconds(ms)); }
 double elapsed() { return std::chrono::duration<double>(Clock::now() - g_start).count(); }
+void waitWritable(int fd, int ms) {
+  pollfd p{fd, POLLOUT, 0};
+  ::poll(&p, 1, ms);
+}
 
-sockaddr_in address(const std::string& ip, int port) {
+sockaddr_in address(const std::string& ip, int port, int offset = 0) {
   sockaddr_in a{};
   a.sin_family = AF_INET;
   a.sin_port = htons(static_cast<std::uint16_t>(port));
   inet_pton(AF_INET, ip.c_str(), &a.sin_addr);
+  a.sin_addr.s_addr = htonl(ntohl(a.sin_addr.s_addr) + static_cast<std::uint32_t>(offset));
   return a;
 }
 
-// The index-th of our addresses, A + index mod kSpread.
-std::string hostAt(int index) {
-  sockaddr_in a = address(g_host, 0);
-  a.sin_addr.s_addr = htonl(ntohl(a.sin_addr.s_addr) + static_cast<std::uint32_t>(index % kSpread));
-  char text[INET_ADDRSTRLEN];
-  inet_ntop(AF_INET, &a.sin_addr, text, sizeof text);
-  return text;
-}
-
-// A non-blocking connection from our index-th address; -1 unless it is up
-// within `timeoutMs`. A small `receiveBuffer` keeps the window the server
-// may fill small.
+// A non-blocking connection from our index-th address (A + index mod
+// kSpread); -1 unless it is up within `timeoutMs`. A small `receiveBuffer`
+// keeps the window the server may fill small.
 int openFrom(int index, int port, int timeoutMs = 500, int receiveBuffer = 0) {
   int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
   if (fd < 0) return -1;
@@ -88,33 +81,25 @@ int openFrom(int index, int port, int timeoutMs = 500, int receiveBuffer = 0) {
   ::setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof one);
   ::setsockopt(fd, IPPROTO_TCP, TCP_NODELAY, &one, sizeof one);
   if (receiveBuffer > 0) ::setsockopt(fd, SOL_SOCKET, SO_RCVBUF, &receiveBuffer, sizeof receiveBuffer);
-  sockaddr_in local = address(hostAt(index), 0);
-  sockaddr_in remote = address(g_server, port);
-  if (::bind(fd, reinterpret_cast<sockaddr*>(&local), sizeof local) != 0 ||
-      (::connect(fd, reinterpret_cast<sockaddr*>(&remote), sizeof remote) != 0 && errno != EINPROGRESS)) {
-    ::close(fd);
-    return -1;
-  }
+  sockaddr_in local = address(g_host, 0, index % kSpread), remote = address(g_server, port);
   pollfd p{fd, POLLOUT, 0};
   int error = 0;
   socklen_t length = sizeof error;
-  if (::poll(&p, 1, timeoutMs) != 1 || ::getsockopt(fd, SOL_SOCKET, SO_ERROR, &error, &length) != 0 || error != 0) {
+  if (::bind(fd, reinterpret_cast<sockaddr*>(&local), sizeof local) != 0 ||
+      (::connect(fd, reinterpret_cast<sockaddr*>(&remote), sizeof remote) != 0 && errno != EINPROGRESS) ||
+      ::poll(&p, 1, timeoutMs) != 1 || ::getsockopt(fd, SOL_SOCKET, SO_ERROR, &error, &length) != 0 || error != 0) {
     ::close(fd);
     return -1;
   }
   return fd;
 }
 
-void closeFd(int& fd) {
+void closeFd(int& fd, bool reset = false) {
+  // A reset leaves no TIME_WAIT behind on our side.
+  linger hard{1, 0};
+  if (fd >= 0 && reset) ::setsockopt(fd, SOL_SOCKET, SO_LINGER, &hard, sizeof hard);
   if (fd >= 0) ::close(fd);
   fd = -1;
-}
-
-// Closes with a reset: no TIME_WAIT left behind on our side.
-void resetFd(int& fd) {
-  linger hard{1, 0};
-  ::setsockopt(fd, SOL_SOCKET, SO_LINGER, &hard, sizeof hard);
-  closeFd(fd);
 }
 
 // The ports in turn: P for even k, 6000 for odd.
@@ -124,10 +109,8 @@ int portOf(int k) { return k % 2 == 0 ? g_port : kControlPort; }
 // to P alone; those that came up.
 std::vector<int> openMany(int count, int first, bool bothPorts, int timeoutMs = 300) {
   std::vector<int> fds;
-  for (int i = first; i < first + count && !timeUp(); ++i) {
-    int fd = openFrom(i, bothPorts ? portOf(i) : g_port, timeoutMs);
-    if (fd >= 0) fds.push_back(fd);
-  }
+  for (int i = first; i < first + count && !timeUp(); ++i)
+    if (int fd = openFrom(i, bothPorts ? portOf(i) : g_port, timeoutMs); fd >= 0) fds.push_back(fd);
   return fds;
 }
 
@@ -140,33 +123,31 @@ long holdToEnd(std::vector<int> fds) {
 
 // What the socket takes now, from `data` on; -1 once the connection failed.
 long sendSome(int fd, const Bytes& data, std::size_t from = 0) {
-  ssize_t n = ::send(fd, data.data() + from, data.size() - from, MSG_NOSIGNAL);
-  if (n >= 0) return n;
-  return errno == EAGAIN || errno == EINTR ? 0 : -1;
+  const ssize_t n = ::send(fd, data.data() + from, data.size() - from, MSG_NOSIGNAL);
+  return n >= 0 ? n : (errno == EAGAIN || errno == EINTR ? 0 : -1);
 }
 
 // All of `data`, waiting for room at most `timeoutMs`; false if it didn't go.
 bool sendAll(int fd, const Bytes& data, int timeoutMs = 1000) {
-  auto deadline = Clock::now() + std::chrono::milliseconds(timeoutMs);
+  const auto deadline = Clock::now() + std::chrono::milliseconds(timeoutMs);
   for (std::size_t done = 0; done < data.size();) {
-    long n = sendSome(fd, data, done);
+    const long n = sendSome(fd, data, done);
     if (n < 0 || Clock::now() > deadline) return false;
     done += static_cast<std::size_t>(n);
-    if (n == 0) {
-      pollfd p{fd, POLLOUT, 0};
-      ::poll(&p, 1, 10);
-    }
+    if (n == 0) waitWritable(fd, 10);
   }
   return true;
 }
 
-// Reads and drops what arrived; true once the server closed or reset it.
-bool closedByServer(int fd) {
-  char buffer[4096];
+// Reads what arrived into `into` (or drops it); true once the server closed
+// or reset the connection.
+bool closedByServer(int fd, Bytes* into = nullptr) {
+  unsigned char buffer[4096];
   for (;;) {
-    ssize_t n = ::recv(fd, buffer, sizeof buffer, MSG_DONTWAIT);
+    const ssize_t n = ::recv(fd, buffer, sizeof buffer, MSG_DONTWAIT);
     if (n == 0) return true;
     if (n < 0) return errno != EAGAIN && errno != EINTR;
+    if (into != nullptr) into->insert(into->end(), buffer, buffer + n);
   }
 }
 
@@ -183,7 +164,8 @@ Bytes frame(std::uint32_t length, std::size_t body, unsigned char fill = 'x') {
   return out;
 }
 
-// `count` copies of one control message, back to back.
+// `count` copies of one control message, back to back; with a value, it
+// alternates between `value` and `value / 8`.
 Bytes controlRun(std::uint32_t type, int count, bool withValue = false, std::uint32_t value = 0) {
   Bytes out;
   for (int i = 0; i < count; ++i) {
@@ -201,7 +183,7 @@ struct Flood {
   std::size_t at = 0;
   long rounds = 0;
   bool push(int fd) {
-    long n = sendSome(fd, data, at);
+    const long n = sendSome(fd, data, at);
     if (n < 0) return false;
     at += static_cast<std::size_t>(n);
     if (at == data.size()) at = 0, ++rounds;
@@ -213,8 +195,7 @@ struct Flood {
 // connection from the same address, and a client's heartbeat: a 3 at once and
 // again a moment after each 4, a 4 for each 3 of the server.
 struct Paired {
-  int data = -1;
-  int control = -1;
+  int data = -1, control = -1;
   Bytes pending;
   bool replied = false;
   Clock::time_point nextBeat = Clock::time_point::max();
@@ -229,23 +210,14 @@ struct Paired {
     if (control < 0) return false;
     beat(3);
     // The server answers once it paired the two; sanitizer builds are slow.
-    auto deadline = Clock::now() + std::chrono::seconds(20);
-    while (!replied && Clock::now() < deadline) {
+    for (auto deadline = Clock::now() + std::chrono::seconds(20); !replied && Clock::now() < deadline; sleepMs(1))
       if (!heartbeat()) return false;
-      sleepMs(1);
-    }
     return replied;
   }
   void beat(std::uint32_t type) { sendAll(control, controlRun(type, 1), 200); }
   // Reads the control channel and answers; false once the server closed it.
   bool heartbeat() {
-    unsigned char buffer[4096];
-    for (;;) {
-      ssize_t n = ::recv(control, buffer, sizeof buffer, MSG_DONTWAIT);
-      if (n == 0 || (n < 0 && errno != EAGAIN && errno != EINTR)) return false;
-      if (n < 0) break;
-      pending.insert(pending.end(), buffer, buffer + n);
-    }
+    if (closedByServer(control, &pending)) return false;
     std::size_t at = 0;
     while (pending.size() - at >= 4) {
       const std::uint32_t length = pending[at] | pending[at + 1] << 8 | pending[at + 2] << 16 | pending[at + 3] << 24;
@@ -253,24 +225,18 @@ struct Paired {
       const unsigned char type = length >= 4 ? pending[at + 4] : 0;
       at += 4 + length;
       if (type == 3) beat(4);
-      if (type == 4) {
-        replied = true;
-        nextBeat = Clock::now() + std::chrono::milliseconds(100);
-      }
+      if (type == 4) replied = true, nextBeat = Clock::now() + std::chrono::milliseconds(100);
     }
     pending.erase(pending.begin(), pending.begin() + static_cast<long>(at));
-    if (Clock::now() >= nextBeat) {
-      nextBeat = Clock::time_point::max();
-      beat(3);
-    }
+    if (Clock::now() >= nextBeat) nextBeat = Clock::time_point::max(), beat(3);
     return true;
   }
 };
 
 // --- the attacks -------------------------------------------------------------
 
-// Opens connections to both ports without a byte, ten to each at a time,
-// and closes them a moment later, once the server has taken them.
+// Connections to both ports without a byte, twenty at a time, closed a
+// moment later, once the server has taken them.
 long scan() {
   long count = 0;
   for (int round = 0; round < 10 && !timeUp(); ++round) {
@@ -306,9 +272,6 @@ long drip() {
   return opened;
 }
 
-// Two hundred silent connections to both ports, held to the end.
-long halfOpen() { return holdToEnd(openMany(200, 0, true)); }
-
 // Messages cut short: the prefix claims more than follows, then the close;
 // every fourth prefix has its top bit set.
 long truncated() {
@@ -332,15 +295,8 @@ long truncated() {
 // Connects and closes as fast as it can, mostly with a reset.
 long connectFlood() {
   long count = 0;
-  for (int k = 0; !timeUp(); ++k) {
-    int fd = openFrom(k, portOf(k), 100);
-    if (fd < 0) continue;
-    ++count;
-    if (k % 4 == 0)
-      closeFd(fd);
-    else
-      resetFd(fd);
-  }
+  for (int k = 0; !timeUp(); ++k)
+    if (int fd = openFrom(k, portOf(k), 100); fd >= 0) ++count, closeFd(fd, k % 4 != 0);
   return count;
 }
 
@@ -373,76 +329,67 @@ long giantPrefix() {
 long smallMessages() {
   int fd = openFrom(0, g_port, 2000);
   long count = 0;
-  for (int i = 0; fd >= 0 && i < 6000 && !timeUp(); ++i) {
+  for (int i = 0; fd >= 0 && i < 6000 && !timeUp(); ++i, ++count) {
     if (!sendAll(fd, frame(8, 8, static_cast<unsigned char>('a' + i % 26)), 1000)) break;
-    ++count;
     std::this_thread::sleep_for(std::chrono::microseconds(200));
   }
   holdToEnd({fd});
   return count;
 }
 
-// Pairs, then floods control messages without reading (echo) or while
-// reading and answering heartbeats (bandwidth).
-long controlFlood(bool echo) {
+// Pairs, then keeps `flood` going on the data or the control channel until
+// the server cuts it off, answering heartbeats if `answer`.
+long pairedFlood(Flood flood, bool onData, bool answer, int receiveBuffer, int pauseMs) {
   Paired peer;
-  if (!peer.open()) return -1;
+  if (!peer.open(receiveBuffer)) return -1;
   say("paired");
-  for (auto until = Clock::now() + std::chrono::milliseconds(500); Clock::now() < until;) {
-    peer.heartbeat();
-    sleepMs(5);
-  }
-  Flood flood{echo ? controlRun(5, 8192) : controlRun(1, 8192, true, 400000)};
+  for (auto until = Clock::now() + std::chrono::milliseconds(500); Clock::now() < until; sleepMs(5)) peer.heartbeat();
   while (!timeUp()) {
-    if (!flood.push(peer.control) || (!echo && !peer.heartbeat())) {
+    if (!flood.push(onData ? peer.data : peer.control) || (answer && !peer.heartbeat())) {
       say("closed-by-server " + std::to_string(elapsed()));
       break;
     }
-    pollfd p{peer.control, POLLOUT, 0};
-    ::poll(&p, 1, 5);
-  }
-  return flood.rounds * 8192;
-}
-
-// Pairs with a small receive window, heartbeats correctly, sends data that
-// the server echoes and never reads it.
-long noRead() {
-  Paired peer;
-  if (!peer.open(4096)) return -1;
-  say("paired");
-  Flood flood{frame(16 << 10, 16 << 10, 'n')};
-  while (!timeUp()) {
-    if (!peer.heartbeat() || !flood.push(peer.data)) {
-      say("closed-by-server " + std::to_string(elapsed()));
-      break;
-    }
-    sleepMs(2);
+    pauseMs > 0 ? sleepMs(pauseMs) : waitWritable(peer.control, 5);
   }
   return flood.rounds;
 }
 
-// Forty-eight silent connections to P, four from each address, held to the
-// end.
-long descriptors() { return holdToEnd(openMany(4 * kSpread, 0, false, 500)); }
+const std::map<std::string, std::function<long()>> kAttacks = {
+    {"scan", scan},
+    {"drip", drip},
+    {"truncated", truncated},
+    {"connect-flood", connectFlood},
+    {"giant-prefix", giantPrefix},
+    {"small-messages", smallMessages},
+    // Two hundred silent connections to both ports, held to the end.
+    {"half-open", [] { return holdToEnd(openMany(200, 0, true)); }},
+    // Forty-eight silent connections to P, four from each address.
+    {"descriptors", [] { return holdToEnd(openMany(4 * kSpread, 0, false, 500)); }},
+    // Echo requests without reading.
+    {"echo-flood", [] { return pairedFlood({controlRun(5, 8192)}, false, false, 0, 0); }},
+    // Bandwidth requests while reading and answering heartbeats.
+    {"bandwidth-flood", [] { return pairedFlood({controlRun(1, 8192, true, 400000)}, false, true, 0, 0); }},
+    // Heartbeats correctly, sends data that the server echoes, never reads
+    // it, with a small receive window.
+    {"no-read", [] { return pairedFlood({frame(16 << 10, 16 << 10, 'n')}, true, true, 4096, 2); }},
+};
 
 }  // namespace
 
 int main(int argc, char** argv) {
   std::string attack;
   double seconds = 3;
-  for (int i = 1; i < argc; ++i) {
-    std::string a = argv[i];
-    const char* value = i + 1 < argc ? argv[++i] : "";
+  for (int i = 1; i + 1 < argc; i += 2) {
+    const std::string a = argv[i], value = argv[i + 1];
     if (a == "--host") g_host = value;
     else if (a == "--server") g_server = value;
-    else if (a == "--port") g_port = std::atoi(value);
+    else if (a == "--port") g_port = std::atoi(value.c_str());
     else if (a == "--attack") attack = value;
-    else if (a == "--seconds") seconds = std::atof(value);
-    else {
-      std::fprintf(stderr, "hostile_peer: unknown option %s\n", a.c_str());
-      return 2;
-    }
+    else if (a == "--seconds") seconds = std::atof(value.c_str());
+    else return std::fprintf(stderr, "hostile_peer: unknown option %s\n", a.c_str()), 2;
   }
+  const auto run = kAttacks.find(attack);
+  if (run == kAttacks.end()) return std::fprintf(stderr, "hostile_peer: unknown attack '%s'\n", attack.c_str()), 2;
   // The test may have lowered the limit it handed down (descriptors); ours is
   // our own business.
   rlimit files{};
@@ -450,31 +397,11 @@ int main(int argc, char** argv) {
     files.rlim_cur = files.rlim_max;
     ::setrlimit(RLIMIT_NOFILE, &files);
   }
-
-  long (*run)() = nullptr;
-  if (attack == "scan") run = scan;
-  else if (attack == "drip") run = drip;
-  else if (attack == "half-open") run = halfOpen;
-  else if (attack == "truncated") run = truncated;
-  else if (attack == "connect-flood") run = connectFlood;
-  else if (attack == "giant-prefix") run = giantPrefix;
-  else if (attack == "small-messages") run = smallMessages;
-  else if (attack == "echo-flood") run = [] { return controlFlood(true); };
-  else if (attack == "bandwidth-flood") run = [] { return controlFlood(false); };
-  else if (attack == "no-read") run = noRead;
-  else if (attack == "descriptors") run = descriptors;
-  if (run == nullptr) {
-    std::fprintf(stderr, "hostile_peer: unknown attack '%s'\n", attack.c_str());
-    return 2;
-  }
   g_start = Clock::now();
   g_end = g_start + std::chrono::duration_cast<Clock::duration>(std::chrono::duration<double>(seconds));
   say("attacking");
-  const long count = run();
-  if (count < 0) {
-    say("error not paired");
-    return 3;
-  }
+  const long count = run->second();
+  if (count < 0) return say("error not paired"), 3;
   say("count " + std::to_string(count));
   say("done");
   return 0;

@@ -16,15 +16,9 @@
 //   burst COUNT PREFIX             COUNT reliable messages "PREFIX<i>;" to every client, each
 //                                  flushed on its own while the network thread is held, so
 //                                  they all leave in one write (one TCP segment)
-#include <poll.h>
-#include <unistd.h>
-
 #include <chrono>
-#include <cstdio>
 #include <cstdlib>
-#include <memory>
 #include <sstream>
-#include <string>
 #include <thread>
 #include <vector>
 
@@ -33,38 +27,11 @@
 #include "N_Initializer.h"
 #include "N_Server.h"
 #include "Q_Exception.h"
+#include "peer_input.h"
 #include "vardel_platform.h"
 #include "win32.h"
 
 namespace {
-
-void say(const std::string& line) {
-  std::fputs(line.c_str(), stdout);
-  std::fputc('\n', stdout);
-  std::fflush(stdout);
-}
-
-// A line of standard input if one is complete; never blocks.
-bool readCommand(std::string& pending, std::string& line, bool& inputClosed) {
-  for (;;) {
-    std::size_t end = pending.find('\n');
-    if (end != std::string::npos) {
-      line = pending.substr(0, end);
-      pending.erase(0, end + 1);
-      return true;
-    }
-    if (inputClosed) return false;
-    pollfd p{0, POLLIN, 0};
-    if (::poll(&p, 1, 0) <= 0) return false;
-    char buffer[4096];
-    ssize_t got = ::read(0, buffer, sizeof buffer);
-    if (got <= 0) {
-      inputClosed = true;
-      return false;
-    }
-    pending.append(buffer, static_cast<std::size_t>(got));
-  }
-}
 
 void burst(const std::vector<N_Client*>& clients, int count, const std::string& prefix) {
   // The runtime's mutex is a named one: holding it keeps the network thread
@@ -90,28 +57,22 @@ void burst(const std::vector<N_Client*>& clients, int count, const std::string& 
 int main(int argc, char** argv) {
   std::string host = "127.0.0.1";
   int port = 3123;
-  for (int i = 1; i < argc; ++i) {
-    std::string a = argv[i];
-    auto next = [&]() -> const char* { return i + 1 < argc ? argv[++i] : ""; };
-    if (a == "--host") host = next();
-    else if (a == "--port") port = std::atoi(next());
-    else if (a == "--hb-frequency") N_Client::setHeartbeatFrequency(std::strtof(next(), nullptr));
-    else if (a == "--hb-latency") N_Client::setHeartbeatLatency(std::strtof(next(), nullptr));
-    else {
-      std::fprintf(stderr, "server_peer: unknown option %s\n", a.c_str());
-      return 2;
-    }
+  for (int i = 1; i + 1 < argc; i += 2) {
+    const std::string a = argv[i], value = argv[i + 1];
+    if (a == "--host") host = value;
+    else if (a == "--port") port = std::atoi(value.c_str());
+    else if (a == "--hb-frequency") N_Client::setHeartbeatFrequency(std::strtof(value.c_str(), nullptr));
+    else if (a == "--hb-latency") N_Client::setHeartbeatLatency(std::strtof(value.c_str(), nullptr));
+    else return std::fprintf(stderr, "server_peer: unknown option %s\n", a.c_str()), 2;
   }
-
   platform::setLocalHost(host.c_str());
   try {
     N_Initializer network;
     N_Server server(port);
     std::vector<N_Client*> clients;
+    CommandInput input;
     say("ready");
-    std::string pending;
-    bool inputClosed = false;
-    for (;;) {
+    while (!input.finished()) {
       server.update();
       N_Client* joined;
       while (server.pollConnect(joined)) {
@@ -122,18 +83,14 @@ int main(int argc, char** argv) {
         void* message;
         unsigned size;
         while (client->poll(message, size))
-          say("recv " + std::to_string(size) + " " +
-              std::string(static_cast<const char*>(message), size < 24 ? size : 24));
+          say("recv " + std::to_string(size) + " " + std::string(static_cast<const char*>(message), size < 24 ? size : 24));
       }
-      std::string line;
-      while (readCommand(pending, line, inputClosed)) {
+      for (std::string line; input.next(line);) {
         std::istringstream in(line);
         std::string command;
         in >> command;
         if (command == "quit") {
-          inputClosed = true;
-          pending.clear();
-          break;
+          input.close();
         } else if (command == "maximum") {
           unsigned value = 0;
           in >> value;
@@ -149,7 +106,6 @@ int main(int argc, char** argv) {
           say("error unknown command " + command);
         }
       }
-      if (inputClosed && pending.empty()) break;
       std::this_thread::sleep_for(std::chrono::milliseconds(1));
     }
     for (N_Client* client : clients) server.disconnectClient(client);

@@ -1,214 +1,186 @@
-// Mutexes, threads, rand, names, start-up and fault plans.
+// Waits, mutexes, threads, rand, names, start-up, and the fault plans of
+// every call.
 #include <atomic>
 #include <cstring>
-#include <string>
+#include <functional>
 #include <thread>
 #include <vector>
 
 #include "fault.h"
-#include "socket_pair.h"
+#include "fault_guard.h"
+#include "platform_test.h"
 
 using namespace platform_test;
+using platform::fault::Call;
 
-TEST(Mutex, OneNameIsOneRecursiveMutexOwnedByThread) {
+namespace {
+
+struct Events {
+  std::vector<WSAEVENT> handles;
+  explicit Events(int n) : handles(n) {
+    for (WSAEVENT& e : handles) e = WSACreateEvent();
+  }
+  ~Events() {
+    for (WSAEVENT e : handles) WSACloseEvent(e);
+  }
+  DWORD wait(DWORD count, DWORD milliseconds = 0) {
+    return WSAWaitForMultipleEvents(count, handles.data(), FALSE, milliseconds, TRUE);
+  }
+};
+
+// The error a call ended with, 0 if it succeeded.
+int errorIf(bool failed) { return failed ? WSAGetLastError() : 0; }
+unsigned noWork(void*) { return 0; }
+void noRoutine(DWORD, DWORD, WSAOVERLAPPED*, DWORD) {}
+
+}  // namespace
+
+TEST(Wait, GivesTheLowestSignalledIndexAndEventsStaySetUntilReset) {
+  Events e(65);
+  ASSERT_TRUE(WSASetEvent(e.handles[63]) && WSASetEvent(e.handles[7]));
+  EXPECT_EQ(7u, e.wait(64));
+  EXPECT_EQ(7u, e.wait(64)) << "manual reset";
+  ASSERT_TRUE(WSAResetEvent(e.handles[7]));
+  EXPECT_EQ(63u, e.wait(64));
+  ASSERT_TRUE(WSAResetEvent(e.handles[63]));
+  EXPECT_EQ(WSA_WAIT_TIMEOUT, e.wait(64, 20));
+  for (DWORD count : {0u, 65u}) {
+    EXPECT_EQ(WSA_WAIT_FAILED, e.wait(count));
+    EXPECT_EQ(WSA_INVALID_PARAMETER, WSAGetLastError());
+  }
+  ASSERT_TRUE(WSACloseEvent(e.handles[1]));
+  EXPECT_FALSE(WSASetEvent(e.handles[1]));
+  EXPECT_EQ(WSA_WAIT_FAILED, e.wait(2));
+  EXPECT_EQ(WSA_INVALID_HANDLE, WSAGetLastError());
+  e.handles[1] = WSACreateEvent();
+}
+
+TEST(Mutex, OneNameIsOneRecursiveMutexOwnedByAThread) {
   HANDLE a = CreateMutexA(nullptr, FALSE, "system test mutex");
   HANDLE b = CreateMutexA(nullptr, FALSE, "system test mutex");
-  ASSERT_NE(nullptr, a);
-  ASSERT_NE(a, b);
+  HANDLE owned = CreateMutexA(nullptr, TRUE, "another name");
   ASSERT_EQ(WAIT_OBJECT_0, WaitForSingleObject(a, INFINITE));
-  ASSERT_EQ(WAIT_OBJECT_0, WaitForSingleObject(b, INFINITE)) << "the owner may take it again";
-  std::thread other([&] {
+  ASSERT_EQ(WAIT_OBJECT_0, WaitForSingleObject(b, 50)) << "the owner may take it again";
+  std::thread([&] {
     EXPECT_EQ(WAIT_TIMEOUT, WaitForSingleObject(b, 0)) << "both handles name one mutex";
+    EXPECT_EQ(WAIT_TIMEOUT, WaitForSingleObject(a, 30));
     EXPECT_FALSE(ReleaseMutex(a)) << "a thread that doesn't own it can't release it";
-  });
-  other.join();
-  EXPECT_TRUE(ReleaseMutex(a));
-  EXPECT_TRUE(ReleaseMutex(b));
+    EXPECT_EQ(WAIT_TIMEOUT, WaitForSingleObject(owned, 0)) << "owned by its creator";
+  }).join();
+  EXPECT_TRUE(ReleaseMutex(a) && ReleaseMutex(b) && ReleaseMutex(owned));
   EXPECT_FALSE(ReleaseMutex(a)) << "released as often as taken";
   EXPECT_TRUE(CloseHandle(a));
-  std::thread again([&] {
-    EXPECT_EQ(WAIT_OBJECT_0, WaitForSingleObject(b, 0)) << "the other handle still works";
-    EXPECT_TRUE(ReleaseMutex(b));
-  });
-  again.join();
-  EXPECT_TRUE(CloseHandle(b));
-  EXPECT_FALSE(CloseHandle(b));
-  HANDLE unrelated = CreateMutexA(nullptr, FALSE, "another name");
-  ASSERT_EQ(WAIT_OBJECT_0, WaitForSingleObject(unrelated, 0));
-  std::thread third([&] {
-    HANDLE fresh = CreateMutexA(nullptr, FALSE, "system test mutex");
-    EXPECT_EQ(WAIT_OBJECT_0, WaitForSingleObject(fresh, 0)) << "other names are other mutexes";
-    ReleaseMutex(fresh);
-    CloseHandle(fresh);
-  });
-  third.join();
-  ReleaseMutex(unrelated);
-  CloseHandle(unrelated);
+  EXPECT_FALSE(CloseHandle(a));
+  std::thread([&] { EXPECT_EQ(WAIT_OBJECT_0, WaitForSingleObject(b, 0)) << "the other handle still works"; }).join();
+  EXPECT_TRUE(CloseHandle(b) && CloseHandle(owned));
 }
 
-TEST(Thread, AfxBeginThreadRunsTheBodyWithItsParameter) {
-  std::atomic<int> value{0};
-  CWinThread* t = AfxBeginThread([](void* p) -> unsigned {
-    static_cast<std::atomic<int>*>(p)->store(42);
-    return 0;
-  }, &value);
-  ASSERT_NE(nullptr, t);
-  for (int i = 0; i < 500 && value == 0; ++i) Sleep(2);
-  EXPECT_EQ(42, value.load());
-  platform::fault::arm(platform::fault::Call::AfxBeginThread, {1, false, WSAENOBUFS});
-  EXPECT_EQ(nullptr, AfxBeginThread([](void*) -> unsigned { return 0; }, nullptr));
-}
-
-TEST(Rand, FollowsTheClassicSequencePerThreadAndIsSeedable) {
+TEST(Rand, FollowsTheClassicSequencePerThreadOrOnAStateOfItsOwn) {
   platform::srand(1);
-  int first[5];
-  for (int& v : first) v = platform::rand();
-  EXPECT_EQ(41, first[0]);
-  EXPECT_EQ(18467, first[1]);
-  EXPECT_EQ(6334, first[2]);
-  EXPECT_EQ(26500, first[3]);
-  EXPECT_EQ(19169, first[4]);
+  for (int expected : {41, 18467, 6334, 26500, 19169}) EXPECT_EQ(expected, platform::rand());
   int fromThread = -1;
-  std::thread t([&] { fromThread = platform::rand(); });
-  t.join();
+  std::thread([&] { fromThread = platform::rand(); }).join();
   EXPECT_EQ(41, fromThread) << "each thread starts at seed 1";
-  platform::srand(777);
-  int a = platform::rand();
-  platform::srand(777);
-  EXPECT_EQ(a, platform::rand());
-  for (int i = 0; i < 100000; ++i) {
-    int v = platform::rand();
-    ASSERT_GE(v, 0);
-    ASSERT_LE(v, 32767);
-  }
-}
-
-TEST(Rand, OnAStateOfItsOwnFollowsTheSameSequenceOnAnyThread) {
-  unsigned state = 1;
-  EXPECT_EQ(41, platform::rand(state));
-  EXPECT_EQ(18467, platform::rand(state));
-  EXPECT_EQ(6334, platform::rand(state));
-  // Whatever the thread's own state does meanwhile, and on any thread.
   for (unsigned seed : {0u, 777u, 0x9E3779B9u}) {
     platform::srand(seed);
-    std::vector<int> expected(50);
-    for (int& v : expected) v = platform::rand();
-    platform::srand(5);
-    unsigned mine = seed;
-    std::vector<int> got(50);
-    std::thread t([&] {
-      for (int& v : got) {
-        v = platform::rand(mine);
-        platform::rand();
-      }
-    });
-    t.join();
-    EXPECT_EQ(expected, got) << seed;
+    unsigned state = seed;
+    for (int i = 0; i < 1000; ++i) {
+      const int v = platform::rand();
+      ASSERT_EQ(v, platform::rand(state));
+      ASSERT_TRUE(v >= 0 && v <= 32767);
+    }
   }
 }
 
-TEST(Names, LocalHostCanBeChosenAndLookupsGivePerThreadRecords) {
+TEST(Names, TheLocalHostCanBeChosenAndLookupsGivePerThreadRecords) {
   char name[1024];
   platform::setLocalHost("127.0.0.2");
   ASSERT_EQ(0, platform::gethostname(name, static_cast<int>(sizeof name)));
   EXPECT_STREQ("127.0.0.2", name);
+  EXPECT_EQ(SOCKET_ERROR, platform::gethostname(name, 9)) << "no room for the end of the name";
   platform::setLocalHost(nullptr);
   ASSERT_EQ(0, platform::gethostname(name, static_cast<int>(sizeof name)));
   EXPECT_STRNE("127.0.0.2", name);
-
   hostent* mine = gethostbyname("localhost");
   ASSERT_NE(nullptr, mine);
-  ASSERT_NE(nullptr, mine->h_addr_list[0]);
-  std::uint32_t address;
-  std::memcpy(&address, mine->h_addr_list[0], 4);
-  EXPECT_EQ(inet_addr("127.0.0.1"), address);
+  EXPECT_EQ(0x0100007Fu, *reinterpret_cast<std::uint32_t*>(mine->h_addr_list[0])) << "network order";
   hostent* theirs = nullptr;
-  std::thread t([&] { theirs = gethostbyname("127.0.0.3"); });
-  t.join();
+  std::thread([&] { theirs = gethostbyname("127.0.0.3"); }).join();
   EXPECT_NE(mine, theirs);
   EXPECT_EQ(nullptr, gethostbyname("no-such-host.invalid"));
-  // Not found; or, on a machine without a reachable name server, try again.
-  const int error = WSAGetLastError();
+  const int error = WSAGetLastError();  // try again where no name server is reachable
   EXPECT_TRUE(error == WSAHOST_NOT_FOUND || error == WSATRY_AGAIN) << error;
-
-  std::uint32_t loop = inet_addr("127.0.0.1");
-  hostent* reverse = gethostbyaddr(reinterpret_cast<char*>(&loop), 4, AF_INET);
-  ASSERT_NE(nullptr, reverse);
-  EXPECT_NE(nullptr, reverse->h_name);
-  platform::fault::arm(platform::fault::Call::gethostbyaddr, {1, false, WSANO_RECOVERY});
-  EXPECT_EQ(nullptr, gethostbyaddr(reinterpret_cast<char*>(&loop), 4, AF_INET));
-  EXPECT_EQ(WSANO_RECOVERY, WSAGetLastError());
-
-  in_addr in{inet_addr("10.1.2.3")};
-  EXPECT_STREQ("10.1.2.3", inet_ntoa(in));
-  EXPECT_EQ(INADDR_NONE, inet_addr("1.2.3.256"));
-  EXPECT_EQ(INADDR_NONE, inet_addr(""));
-  EXPECT_EQ(0x0100007Fu, inet_addr("127.0.0.1")) << "network order";
 }
 
-TEST(Startup, AgreesOnTwoPointZeroAndDescribesTcpAndUdpProviders) {
+TEST(Faults, PlansPersistWhenAskedAndDisarmingRestoresEverything) {
+  FaultGuard faults(Call::WSAStartup, {1, true, WSAEPROCLIM});
   WSADATA data{};
-  ASSERT_EQ(0, WSAStartup(0x0002, &data));
+  for (int i = 0; i < 2; ++i) EXPECT_EQ(WSAEPROCLIM, WSAStartup(0x0002, &data));
+  EXPECT_EQ(2, platform::fault::fired(Call::WSAStartup));
+  faults.failAllocation(2, true);
+  EXPECT_FALSE(platform::fault::allocationShouldFail());
+  EXPECT_TRUE(platform::fault::allocationShouldFail() && platform::fault::allocationShouldFail());
+  EXPECT_EQ(2, platform::fault::allocationsFailed());
+  faults.setAgreedVersion(0x0101);
+  faults.setCatalogue({});
+  platform::fault::disarmAll();
+  EXPECT_FALSE(platform::fault::allocationShouldFail());
+  EXPECT_EQ(0, WSAStartup(0x0002, &data));
   EXPECT_EQ(0x0002, data.wVersion);
   DWORD size = 0;
   EXPECT_EQ(SOCKET_ERROR, WSAEnumProtocolsA(nullptr, nullptr, &size));
-  EXPECT_EQ(WSAENOBUFS, WSAGetLastError());
-  ASSERT_EQ(0u, size % sizeof(WSAPROTOCOL_INFOA));
-  std::vector<WSAPROTOCOL_INFOA> list(size / sizeof(WSAPROTOCOL_INFOA));
-  int n = WSAEnumProtocolsA(nullptr, list.data(), &size);
-  ASSERT_EQ(static_cast<int>(list.size()), n);
-  bool tcp = false, udp = false;
-  for (const auto& p : list) {
-    if (p.iAddressFamily != AF_INET) continue;
-    tcp = tcp || (p.iSocketType == SOCK_STREAM && (p.dwServiceFlags1 & 0x20066) == 0x20066);
-    udp = udp || (p.iSocketType == SOCK_DGRAM && (p.dwServiceFlags1 & 0x20609) == 0x20609);
-  }
-  EXPECT_TRUE(tcp);
-  EXPECT_TRUE(udp);
-
-  SOCKET s = WSASocketA(FROM_PROTOCOL_INFO, FROM_PROTOCOL_INFO, FROM_PROTOCOL_INFO, &list[1], 0, WSA_FLAG_OVERLAPPED);
-  ASSERT_NE(INVALID_SOCKET, s);
-  EXPECT_EQ(0, WSACleanup());
-  EXPECT_EQ(SOCKET_ERROR, closesocket(s)) << "the last cleanup closed the socket";
-  EXPECT_EQ(INVALID_SOCKET, WSASocketA(AF_INET, SOCK_DGRAM, IPPROTO_UDP, nullptr, 0, 0));
-  EXPECT_EQ(WSANOTINITIALISED, WSAGetLastError());
-  EXPECT_EQ(SOCKET_ERROR, WSACleanup());
+  EXPECT_GT(size, 0u) << "the real catalogue is back";
+  WSACleanup();
 }
 
-TEST(Faults, PlansFireAtTheirCountAndPersistWhenAsked) {
-  using platform::fault::Call;
-  WSADATA data{};
-  platform::fault::arm(Call::WSAStartup, {2, false, WSASYSNOTREADY});
-  EXPECT_EQ(0, WSAStartup(0x0002, &data));
-  EXPECT_EQ(WSASYSNOTREADY, WSAStartup(0x0002, &data));
-  EXPECT_EQ(0, WSAStartup(0x0002, &data));
-  EXPECT_EQ(1, platform::fault::fired(Call::WSAStartup));
-  platform::fault::arm(Call::WSAStartup, {1, true, WSAEPROCLIM});
-  EXPECT_EQ(WSAEPROCLIM, WSAStartup(0x0002, &data));
-  EXPECT_EQ(WSAEPROCLIM, WSAStartup(0x0002, &data));
-  platform::fault::setAgreedVersion(0x0101);
-  platform::fault::disarm(Call::WSAStartup);
-  EXPECT_EQ(0, WSAStartup(0x0002, &data));
-  EXPECT_EQ(0x0101, data.wVersion);
-  WSAPROTOCOL_INFOA none{};
-  platform::fault::setCatalogue(&none, 0);
-  DWORD size = 123;
-  EXPECT_EQ(0, WSAEnumProtocolsA(nullptr, nullptr, &size));
-  EXPECT_EQ(0u, size);
-  platform::fault::disarmAll();
-  EXPECT_GT(WSAEnumProtocolsA(nullptr, nullptr, &(size = 0)), -2);
-  EXPECT_GT(size, 0u) << "disarmAll restores the real catalogue";
-
-  platform::fault::failAllocation(3);
-  EXPECT_FALSE(platform::fault::allocationShouldFail());
-  EXPECT_FALSE(platform::fault::allocationShouldFail());
-  EXPECT_TRUE(platform::fault::allocationShouldFail());
-  EXPECT_FALSE(platform::fault::allocationShouldFail());
-  platform::fault::failAllocation(1, true);
-  EXPECT_TRUE(platform::fault::allocationShouldFail());
-  EXPECT_TRUE(platform::fault::allocationShouldFail());
-  EXPECT_EQ(2, platform::fault::allocationsFailed());
-  platform::fault::disarmAll();
-  EXPECT_FALSE(platform::fault::allocationShouldFail());
-  for (int i = 0; i < 4; ++i) WSACleanup();
+// Each call answers its plan's result on the second call only: the first and
+// the third behave as without a plan.
+TEST(Faults, EveryCallFailsAsItsPlanSays) {
+  constexpr int kCode = 10050;
+  Winsock ws;
+  std::uint16_t port;
+  SOCKET listener = makeListener(port), tcp = tcpSocket(), udp = udpSocket();
+  WSAEVENT event = WSACreateEvent();
+  sockaddr_in any = loopback(0);
+  int length = sizeof any, option = 1;
+  char buffer[4];
+  WSABUF buf{sizeof buffer, buffer};
+  WSAOVERLAPPED ov{};
+  WSANETWORKEVENTS ne{};
+  std::uint32_t loop = inet_addr("127.0.0.1");
+  DWORD size = 0;
+  const std::vector<std::pair<Call, std::function<int()>>> calls = {
+      {Call::WSAStartup, [] { WSADATA d; int rc = WSAStartup(2, &d); return rc != 0 ? rc : WSACleanup(); }},
+      {Call::WSAEnumProtocolsA, [&] { return errorIf(WSAEnumProtocolsA(nullptr, nullptr, &size) < 0); }},
+      {Call::WSASocketA, [] { SOCKET s = udpSocket(); return s == INVALID_SOCKET ? WSAGetLastError() : closesocket(s); }},
+      {Call::bind, [&] { return errorIf(bind(udp, asAddr(any), sizeof any) != 0); }},
+      {Call::listen, [&] { return errorIf(listen(listener, 5) != 0); }},
+      {Call::getsockname, [&] { return errorIf(getsockname(udp, reinterpret_cast<sockaddr*>(&any), &length) != 0); }},
+      {Call::setsockopt, [&] { return errorIf(setsockopt(tcp, SOL_SOCKET, SO_KEEPALIVE, reinterpret_cast<char*>(&option), 4) != 0); }},
+      {Call::getsockopt, [&] { return errorIf(getsockopt(tcp, SOL_SOCKET, SO_KEEPALIVE, reinterpret_cast<char*>(&option), &length) != 0); }},
+      {Call::WSAConnect, [&] { return errorIf(connectTo(udp, port) != 0); }},
+      {Call::WSAAccept, [&] { return errorIf(WSAAccept(listener, nullptr, nullptr, nullptr, 0) == INVALID_SOCKET); }},
+      {Call::WSASendDisconnect, [&] { return errorIf(WSASendDisconnect(tcp, nullptr) != 0); }},
+      {Call::WSAEventSelect, [&] { return errorIf(WSAEventSelect(tcp, event, FD_READ) != 0); }},
+      {Call::WSAEnumNetworkEvents, [&] { return errorIf(WSAEnumNetworkEvents(tcp, event, &ne) != 0); }},
+      {Call::WSASend, [&] { return errorIf(WSASend(tcp, &buf, 1, nullptr, 0, &ov, noRoutine) != 0); }},
+      {Call::WSARecv, [&] { return errorIf(WSARecv(tcp, &buf, 1, nullptr, nullptr, &ov, noRoutine) != 0); }},
+      {Call::closesocket, [] { return errorIf(closesocket(udpSocket()) != 0); }},
+      {Call::WSACreateEvent, [] { WSAEVENT e = WSACreateEvent(); return e == nullptr ? WSAGetLastError() : !WSACloseEvent(e); }},
+      {Call::WSAWaitForMultipleEvents, [&] { return errorIf(WSAWaitForMultipleEvents(1, &event, FALSE, 0, TRUE) == WSA_WAIT_FAILED); }},
+      {Call::gethostbyname, [] { return errorIf(gethostbyname("localhost") == nullptr); }},
+      {Call::gethostbyaddr, [&] { return errorIf(gethostbyaddr(reinterpret_cast<char*>(&loop), 4, AF_INET) == nullptr); }},
+      {Call::CreateMutexA, [] { HANDLE h = CreateMutexA(nullptr, FALSE, nullptr); return h == nullptr ? WSAGetLastError() : !CloseHandle(h); }},
+      {Call::AfxBeginThread, [] { return errorIf(AfxBeginThread(noWork, nullptr) == nullptr); }},
+  };
+  ASSERT_EQ(static_cast<std::size_t>(Call::Count), calls.size());
+  for (const auto& [call, run] : calls) {
+    FaultGuard faults(call, {.countdown = 2, .persist = false, .result = kCode});
+    EXPECT_NE(kCode, run()) << platform::fault::name(call);
+    EXPECT_EQ(kCode, run()) << platform::fault::name(call);
+    EXPECT_NE(kCode, run()) << platform::fault::name(call);
+    EXPECT_EQ(1, platform::fault::fired(call)) << platform::fault::name(call);
+  }
+  for (SOCKET s : {listener, tcp}) closesocket(s);
+  WSACloseEvent(event);
 }

@@ -1,266 +1,181 @@
-// Failures of the runtime's start, one per test (every case runs in a process
-// of its own): the exception and its text, what is left behind, and that a
-// later N_Initializer of the process is a no-op.
+// Failures of the runtime's start, each in a process of its own (a failed
+// start isn't undone, and later instances of the process are no-ops): the
+// exception, what is left behind, and that a further instance does nothing.
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdio>
 #include <cstring>
+#include <functional>
+#include <ostream>
 #include <string>
 #include <vector>
-
-#include <gtest/gtest.h>
 
 #include "N_Address.h"
 #include "N_Exceptions.h"
 #include "N_Initializer.h"
-#include "Q_Memory.h"
-#include "fault.h"
+#include "allocation_balance.h"
 #include "fault_guard.h"
-#include "tasks.h"
+#include "runtime_test.h"
+#include "threads.h"
+#include "watchdog.h"
 #include "winsock.h"
 
 namespace {
 
-using platform::fault::Call;
+using platform::DWORD;
 using platform::WSAPROTOCOL_INFOA;
+using platform::fault::Call;
+using Arm = std::function<void(FaultGuard&)>;
 
-constexpr platform::DWORD kTcpBits[] = {platform::XP1_GUARANTEED_DELIVERY, platform::XP1_GUARANTEED_ORDER,
-                                        platform::XP1_GRACEFUL_CLOSE, platform::XP1_EXPEDITED_DATA,
-                                        platform::XP1_IFS_HANDLES};
-constexpr platform::DWORD kUdpBits[] = {platform::XP1_CONNECTIONLESS, platform::XP1_MESSAGE_ORIENTED,
-                                        platform::XP1_SUPPORT_BROADCAST, platform::XP1_SUPPORT_MULTIPOINT,
-                                        platform::XP1_IFS_HANDLES};
+constexpr DWORD kTcp[] = {platform::XP1_GUARANTEED_DELIVERY, platform::XP1_GUARANTEED_ORDER,
+                          platform::XP1_GRACEFUL_CLOSE, platform::XP1_EXPEDITED_DATA, platform::XP1_IFS_HANDLES};
+constexpr DWORD kUdp[] = {platform::XP1_CONNECTIONLESS, platform::XP1_MESSAGE_ORIENTED,
+                          platform::XP1_SUPPORT_BROADCAST, platform::XP1_SUPPORT_MULTIPOINT, platform::XP1_IFS_HANDLES};
+constexpr DWORD kAllTcp = 0x20066, kAllUdp = 0x20609;
+constexpr const char* kNoTcp = "TCP protocol not found";
+constexpr const char* kVersion = "Winsock version 2.0 or newer required";
+constexpr const char* kNotResolved = "IP address is not resolved yet";
 
-platform::DWORD all(const platform::DWORD (&bits)[5]) {
-  platform::DWORD flags = 0;
-  for (platform::DWORD b : bits) flags |= b;
-  return flags;
-}
-
-WSAPROTOCOL_INFOA entry(int family, platform::DWORD flags, int type = 1, int protocol = 6) {
+WSAPROTOCOL_INFOA entry(int family, DWORD flags) {
   WSAPROTOCOL_INFOA info{};
   info.iAddressFamily = family;
   info.dwServiceFlags1 = flags;
-  info.iSocketType = type;
-  info.iProtocol = protocol;
   return info;
 }
 
-// Starts the runtime and expects it to throw C* with `text`.
-template <class C>
-void expectStartThrows(const char* text) {
+Arm startup(int code) { return [=](FaultGuard& f) { f.arm(Call::WSAStartup, {1, false, code}); }; }
+Arm version(platform::WORD agreed) { return [=](FaultGuard& f) { f.setAgreedVersion(agreed); }; }
+Arm catalogue(std::vector<WSAPROTOCOL_INFOA> list) { return [=](FaultGuard& f) { f.setCatalogue(list); }; }
+Arm localHost(const char* host, Call call = Call::Count, int countdown = 1) {
+  return [=](FaultGuard& f) {
+    platform::setLocalHost(host);
+    if (call != Call::Count) f.arm(call, {countdown, true, 11001});
+  };
+}
+
+struct StartCase {
+  std::string name;
+  Arm arm;
+  const char* text;
+  bool winsockLeftUp = true;  // only a refusal or a wrong version closes it
+  bool threadRuns = false;    // the local address comes after the network thread
+};
+void PrintTo(const StartCase& c, std::ostream* os) { *os << c.name; }
+
+std::vector<StartCase> startCases() {
+  std::vector<StartCase> cases = {
+      {"SystemNotReady", startup(10091), "WINSOCK: Network subsystem is unavailable", false},
+      {"VersionNotSupported", startup(10092), "WINSOCK: DLL version out of range", false},
+      {"ProcessLimit", startup(10067), "WINSOCK: Too many processes", false},
+      {"OtherRefusalFailsTheVersionTest", startup(10014), kVersion, false},
+      {"Version1_0", version(0x0001), kVersion, false},
+      {"Version1_1", version(0x0101), kVersion, false},
+      {"Version2_1", version(0x0102), kVersion, false},  // the minor version is the high byte
+      {"Version2_2", version(0x0202), kVersion, false},
+      {"Version3_0", version(0x0003), kVersion, false},
+      {"EmptyCatalogue", catalogue({}), kNoTcp},
+      {"FailedEnumeration", [](FaultGuard& f) { f.arm(Call::WSAEnumProtocolsA, {1, true, 10055}); }, kNoTcp},
+      {"OnlyOutsideIpv4", catalogue({entry(23, kAllTcp | kAllUdp), entry(0, kAllTcp)}), kNoTcp},
+      {"TcpIsJudgedFirst", catalogue({entry(2, kAllUdp & ~kTcp[4]), entry(2, kAllTcp & ~kTcp[4])}), kNoTcp},
+      {"UnknownHost", localHost("no-such-host.invalid"), kNotResolved, true, true},
+      {"FailedLookup", localHost("localhost", Call::gethostbyname), kNotResolved, true, true},
+      {"AllZeros", localHost("0.0.0.0"), kNotResolved, true, true},
+      // The first thread is the network thread, the second the resolver.
+      {"NoResolver", localHost("localhost", Call::AfxBeginThread, 2), kNotResolved, true, true},
+  };
+  for (int i = 0; i < 5; ++i) {
+    const std::string bit = std::to_string(i);
+    cases.push_back({"TcpWithoutBit" + bit, catalogue({entry(2, kAllTcp & ~kTcp[i]), entry(2, kAllUdp)}), kNoTcp});
+    cases.push_back({"UdpWithoutBit" + bit, catalogue({entry(2, kAllTcp), entry(2, kAllUdp & ~kUdp[i])}),
+                     "UDP protocol not found"});
+  }
+  return cases;
+}
+
+class StartFailure : public ::testing::TestWithParam<StartCase> {};
+
+TEST_P(StartFailure, ThrowsAndLaterInstancesAreNoOps) {
+  const StartCase& c = GetParam();
+  platform::setLocalHost("127.0.0.1");
+  Watchdog dog(60.0, "a start that fails");
+  const int idle = threadCount();
+  FaultGuard faults;
+  c.arm(faults);
   try {
     N_Initializer network;
     ADD_FAILURE() << "the start didn't throw";
-  } catch (C* e) {
-    ASSERT_NE(e, nullptr);
-    EXPECT_STREQ(e->getErrorMessage(), text);
   } catch (Q_Exception* e) {
-    ADD_FAILURE() << "wrong exception class, text \"" << e->getErrorMessage() << "\"";
+    EXPECT_STREQ(c.text, e->getErrorMessage());
   }
-}
-
-// After a failed start the count stays raised: a further instance neither
-// throws nor starts anything, and its destruction stops nothing.
-void expectLaterInstanceIsNoOp() {
   const N_Address* local = N_Address::getLocalAddress();
-  std::set<int> before = tasks::ids();
-  int news = Q_Memory::sm_iNewCount.load();
+  ASSERT_EQ(c.threadRuns, local != nullptr);
+  EXPECT_EQ(0u, local != nullptr ? local->getIdentifier() : 0u);
+  EXPECT_TRUE(waitFor([&] { return threadCount() == idle + (c.threadRuns ? 1 : 0); }));
+  EXPECT_EQ(c.winsockLeftUp ? 0 : platform::SOCKET_ERROR, platform::WSACleanup());
+
+  AllocationBalance balance;
+  const int threads = threadCount();
   {
     N_Initializer again;
-    EXPECT_EQ(N_Address::getLocalAddress(), local);
+    EXPECT_EQ(local, N_Address::getLocalAddress());
   }
-  EXPECT_EQ(Q_Memory::sm_iNewCount.load(), news) << "a further instance allocated";
-  EXPECT_EQ(N_Address::getLocalAddress(), local);
-  for (int tid : tasks::ids()) EXPECT_TRUE(before.count(tid)) << "a further instance started a thread";
+  EXPECT_EQ(0, balance.outstanding()) << "a further instance allocated";
+  EXPECT_EQ(threads, threadCount()) << "a further instance started a thread";
 }
 
-class StartFailure : public ::testing::Test {
- protected:
-  void SetUp() override {
-    platform::setLocalHost("127.0.0.1");
-    before = tasks::ids();
-  }
-  void TearDown() override { platform::setLocalHost(nullptr); }
+INSTANTIATE_TEST_SUITE_P(Each, StartFailure, ::testing::ValuesIn(startCases()),
+                         [](const ::testing::TestParamInfo<StartCase>& p) { return p.param.name; });
 
-  // No thread was started by the failed start.
-  void expectNoNewThread() {
-    for (int tid : tasks::ids()) EXPECT_TRUE(before.count(tid)) << "thread " << tid << " was started";
-  }
-
+// For each kind the first IPv4 entry with every bit wins, however late; type
+// and protocol aren't looked at.
+TEST(StartCatalogue, TheFirstEntryWithEveryBitServesEachKind) {
+  platform::setLocalHost("127.0.0.1");
   FaultGuard faults;
-  std::set<int> before;
-};
-
-// ---- Winsock refuses to start ---------------------------------------------
-
-TEST_F(StartFailure, SystemNotReady) {
-  faults.arm(Call::WSAStartup, {.countdown = 1, .persist = false, .result = 10091});
-  expectStartThrows<N_NetException_Unavailable>("WINSOCK: Network subsystem is unavailable");
-  expectNoNewThread();
-  expectLaterInstanceIsNoOp();
-}
-
-TEST_F(StartFailure, VersionNotSupported) {
-  faults.arm(Call::WSAStartup, {.countdown = 1, .persist = false, .result = 10092});
-  expectStartThrows<N_NetException_NotSupported>("WINSOCK: DLL version out of range");
-  expectNoNewThread();
-  expectLaterInstanceIsNoOp();
-}
-
-TEST_F(StartFailure, ProcessLimit) {
-  faults.arm(Call::WSAStartup, {.countdown = 1, .persist = false, .result = 10067});
-  expectStartThrows<N_NetException_ProcessLimit>("WINSOCK: Too many processes");
-  expectNoNewThread();
-  expectLaterInstanceIsNoOp();
-}
-
-// Another refusal than the three named isn't judged by its code; with
-// nothing agreed on, the version test fails it.
-TEST_F(StartFailure, OtherStartupErrorFailsTheVersionTest) {
-  faults.arm(Call::WSAStartup, {.countdown = 1, .persist = false, .result = 10014});
-  expectStartThrows<N_NetException_VersionFailure>("Winsock version 2.0 or newer required");
-  expectNoNewThread();
-  expectLaterInstanceIsNoOp();
-}
-
-// ---- The agreed version must be 2.0 exactly -------------------------------
-
-class AgreedVersion : public StartFailure, public ::testing::WithParamInterface<platform::WORD> {};
-
-TEST_P(AgreedVersion, OtherThanTwoZeroFailsAndClosesWinsock) {
-  faults.setAgreedVersion(GetParam());
-  expectStartThrows<N_NetException_VersionFailure>("Winsock version 2.0 or newer required");
-  // Winsock was started once and closed again: nothing is left to close.
-  EXPECT_EQ(platform::WSACleanup(), platform::SOCKET_ERROR);
-  EXPECT_EQ(platform::WSAGetLastError(), platform::WSANOTINITIALISED);
-  expectNoNewThread();
-  expectLaterInstanceIsNoOp();
-}
-
-// 1.0, 1.1, 2.1 (minor in the high byte), 2.2, 3.0.
-INSTANTIATE_TEST_SUITE_P(Versions, AgreedVersion,
-                         ::testing::Values(platform::WORD{0x0001}, platform::WORD{0x0101}, platform::WORD{0x0102},
-                                           platform::WORD{0x0202}, platform::WORD{0x0003}));
-
-// ---- Provider catalogue ---------------------------------------------------
-
-TEST_F(StartFailure, EmptyCatalogueHasNoTcp) {
-  faults.setCatalogue({});
-  expectStartThrows<N_NetException_NoTCP>("TCP protocol not found");
-  // Winsock stays started: only the version failure closes it.
-  EXPECT_EQ(platform::WSACleanup(), 0);
-  expectNoNewThread();
-  expectLaterInstanceIsNoOp();
-}
-
-TEST_F(StartFailure, FailedEnumerationHasNoTcp) {
-  faults.arm(Call::WSAEnumProtocolsA, {.countdown = 1, .persist = true, .result = 10055});
-  expectStartThrows<N_NetException_NoTCP>("TCP protocol not found");
-  EXPECT_EQ(platform::fault::fired(Call::WSAEnumProtocolsA), 2);
-  expectNoNewThread();
-  expectLaterInstanceIsNoOp();
-}
-
-TEST_F(StartFailure, TcpAndUdpOnlyOutsideIpv4HaveNoTcp) {
-  faults.setCatalogue({entry(23, all(kTcpBits)), entry(23, all(kUdpBits), 2, 17), entry(0, all(kTcpBits))});
-  expectStartThrows<N_NetException_NoTCP>("TCP protocol not found");
-  expectNoNewThread();
-}
-
-class TcpBitMissing : public StartFailure, public ::testing::WithParamInterface<int> {};
-
-TEST_P(TcpBitMissing, NoTcp) {
-  platform::DWORD flags = all(kTcpBits) & ~kTcpBits[GetParam()];
-  faults.setCatalogue({entry(2, flags), entry(2, all(kUdpBits), 2, 17)});
-  expectStartThrows<N_NetException_NoTCP>("TCP protocol not found");
-  expectNoNewThread();
-  expectLaterInstanceIsNoOp();
-}
-
-INSTANTIATE_TEST_SUITE_P(EachBit, TcpBitMissing, ::testing::Range(0, 5));
-
-class UdpBitMissing : public StartFailure, public ::testing::WithParamInterface<int> {};
-
-TEST_P(UdpBitMissing, NoUdp) {
-  platform::DWORD flags = all(kUdpBits) & ~kUdpBits[GetParam()];
-  faults.setCatalogue({entry(2, all(kTcpBits)), entry(2, flags, 2, 17)});
-  expectStartThrows<N_NetException_NoUDP>("UDP protocol not found");
-  expectNoNewThread();
-  expectLaterInstanceIsNoOp();
-}
-
-INSTANTIATE_TEST_SUITE_P(EachBit, UdpBitMissing, ::testing::Range(0, 5));
-
-// TCP is judged first: with neither provider it is TCP that is missing.
-TEST_F(StartFailure, NeitherProviderReportsTcp) {
-  faults.setCatalogue({entry(2, all(kUdpBits) & ~platform::XP1_IFS_HANDLES),
-                       entry(2, all(kTcpBits) & ~platform::XP1_IFS_HANDLES)});
-  expectStartThrows<N_NetException_NoTCP>("TCP protocol not found");
-}
-
-// ---- Catalogues that do serve ---------------------------------------------
-
-class Catalogue : public StartFailure {
- protected:
-  void expectStarts() {
+  std::vector<WSAPROTOCOL_INFOA> late(20, entry(23, kAllTcp | kAllUdp));
+  for (DWORD bit : kTcp) late.push_back(entry(2, kAllTcp & ~bit));
+  late.push_back(entry(2, kAllUdp | 0x80000000u));
+  late.push_back(entry(2, kAllTcp | 0x10u));
+  for (const auto& list : {std::vector<WSAPROTOCOL_INFOA>{entry(2, kAllTcp | kAllUdp)}, late}) {
+    faults.setCatalogue(list);
     try {
       N_Initializer network;
-      EXPECT_NE(N_Address::getLocalAddress(), nullptr);
+      EXPECT_NE(nullptr, N_Address::getLocalAddress());
     } catch (Q_Exception* e) {
       ADD_FAILURE() << "start failed: " << e->getErrorMessage();
     }
   }
-};
-
-// One entry with all ten bits serves both kinds; socket type and protocol
-// aren't looked at.
-TEST_F(Catalogue, OneEntryServesBoth) {
-  faults.setCatalogue({entry(2, all(kTcpBits) | all(kUdpBits), 99, 99)});
-  expectStarts();
 }
 
-// The walk goes on past unusable entries, to the end of the catalogue.
-TEST_F(Catalogue, UsableEntriesLateInTheCatalogue) {
-  std::vector<WSAPROTOCOL_INFOA> list;
-  for (int i = 0; i < 20; ++i) list.push_back(entry(23, all(kTcpBits) | all(kUdpBits)));
-  for (int i = 0; i < 5; ++i) list.push_back(entry(2, all(kTcpBits) & ~kTcpBits[i]));
-  list.push_back(entry(2, all(kUdpBits) | 0x80000000u, 2, 17));
-  list.push_back(entry(2, all(kTcpBits) | 0x10u));
-  faults.setCatalogue(list);
-  expectStarts();
-}
-
-// ---- Allocations that give nothing ----------------------------------------
-//
-// The start allocates, in order: six lists, the catalogue buffer, the local
-// address object, and inside its construct the shared block and the number
-// string.
-
-class AllocationFailure : public StartFailure, public ::testing::WithParamInterface<int> {};
-
-TEST_P(AllocationFailure, RaisesAllocationAndKeepsWhatWasMade) {
-  const int nth = GetParam();
-  faults.failAllocation(nth);
-  int news = Q_Memory::sm_iNewCount.load();
-  int deletes = Q_Memory::sm_iDeleteCount.load();
-  expectStartThrows<Q_MemoryException_Allocation>("Out of system memory resources");
-  EXPECT_EQ(platform::fault::allocationsFailed(), 1);
-
-  // Everything made before the failure stays (a failed start isn't undone);
-  // the refused allocation is counted as well. A local address that failed
-  // in its construct leaves nothing of its own.
-  int expectedOutstanding = nth <= 8 ? nth : 8;
-  int outstanding = (Q_Memory::sm_iNewCount.load() - news) - (Q_Memory::sm_iDeleteCount.load() - deletes);
-  EXPECT_EQ(outstanding, expectedOutstanding);
-
-  if (nth <= 7) {
-    expectNoNewThread();
-  } else {
-    // The failure row of the local address: the network thread runs.
-    EXPECT_NE(tasks::theNewThread(before), -1);
+// Allocation N = 1, 2, 3 ... of a start fails, each in a child process, until
+// a start meets no failure. The start throws the allocation failure, or
+// succeeds where the failure hit a thread that copes with it.
+TEST(StartAllocation, EveryAllocationOfTheStartMayFail) {
+  platform::setLocalHost("127.0.0.1");
+  enum Outcome { kDone = 10, kThrew, kCoped, kOther };
+  for (int n = 1;; ++n) {
+    ASSERT_LT(n, 200) << "the start never ran without the failure";
+    const pid_t child = ::fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+      platform::fault::failAllocation(n);
+      int outcome = kOther;
+      try {
+        N_Initializer network;
+        outcome = platform::fault::allocationsFailed() == 0 ? kDone : kCoped;
+      } catch (Q_MemoryException_Allocation* e) {
+        if (std::strcmp(e->getErrorMessage(), "Out of system memory resources") == 0) outcome = kThrew;
+      } catch (...) {
+      }
+      ::_exit(outcome);
+    }
+    int status = 0;
+    ASSERT_EQ(child, ::waitpid(child, &status, 0));
+    const int outcome = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+    if (outcome == kDone) break;
+    ASSERT_TRUE(outcome == kThrew || outcome == kCoped) << "allocation " << n << ": outcome " << outcome;
+    std::printf("allocation %d: %s\n", n, outcome == kThrew ? "the start threw" : "coped with");
   }
-  EXPECT_EQ(N_Address::getLocalAddress(), nullptr);
-  expectLaterInstanceIsNoOp();
 }
-
-INSTANTIATE_TEST_SUITE_P(EachAllocation, AllocationFailure, ::testing::Range(1, 11));
 
 }  // namespace

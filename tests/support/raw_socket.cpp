@@ -3,7 +3,10 @@
 #include <arpa/inet.h>
 #include <netinet/in.h>
 #include <poll.h>
+#include <fcntl.h>
+#include <sys/file.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -32,6 +35,19 @@ bool bindable(int type, std::uint16_t port) {
   bool ok = ::bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof a) == 0;
   ::close(fd);
   return ok;
+}
+
+// Claims `port` against every other test process of the machine until this
+// one ends: two processes that both find a port free would otherwise both
+// take it. The descriptor stays open on purpose.
+bool claim(std::uint16_t port) {
+  ::mkdir("/tmp/vardel-ports", 01777);
+  const std::string path = "/tmp/vardel-ports/" + std::to_string(port);
+  const int fd = ::open(path.c_str(), O_RDONLY | O_CREAT | O_CLOEXEC, 0666);
+  if (fd < 0) return false;
+  if (::flock(fd, LOCK_EX | LOCK_NB) == 0) return true;
+  ::close(fd);
+  return false;
 }
 
 }  // namespace
@@ -135,8 +151,10 @@ int udpBound(const char* ip, std::uint16_t port) {
 std::uint16_t freePort(bool pairWithNext) {
   std::mt19937 pick(static_cast<unsigned>(std::chrono::steady_clock::now().time_since_epoch().count() ^ ::getpid()));
   for (int attempt = 0; attempt < 1000; ++attempt) {
-    auto port = static_cast<std::uint16_t>(20000 + pick() % 30000);
-    if (port == 6000 || port == 5999) continue;
+    // Below the system's ephemeral range (32768 up), so that no outgoing
+    // connection of another test takes it meanwhile.
+    auto port = static_cast<std::uint16_t>(20000 + pick() % 12700);
+    if (!claim(port) || (pairWithNext && !claim(port + 1))) continue;
     bool ok = bindable(SOCK_STREAM, port) && bindable(SOCK_DGRAM, port);
     if (ok && pairWithNext) ok = bindable(SOCK_STREAM, port + 1) && bindable(SOCK_DGRAM, port + 1);
     if (ok) return port;

@@ -1,0 +1,323 @@
+// Sockets and listeners through their public interface: construction and its
+// failures, connect and disconnect events, UDP, sockets destroyed while the
+// network thread works for them, the connect queue, and the 64-event wait set.
+#include <filesystem>
+#include <iterator>
+#include <memory>
+#include <thread>
+#include <utility>
+
+#include "endpoint_test.h"
+#include "limits_guard.h"
+#include "raw_peer.h"
+
+namespace {
+
+class SocketTest : public EndpointTest {};
+
+int registeredSockets() {
+  int n = 0;
+  for (N_Socket** s = N_Socket::getFirstSocket(); s != nullptr; s = N_Socket::getNextSocket(s)) ++n;
+  return n;
+}
+
+class FlagSocket : public N_Socket {
+ public:
+  ~FlagSocket() { destruct(); }
+  bool receiveConnect() override { return ++connects, keep; }
+  bool receiveDisconnect() override { return ++disconnects, keep; }
+  std::atomic<int> connects{0}, disconnects{0};
+  bool keep = true;
+};
+
+// A failed construction leaves the object as it was, ready for another. A
+// UDP socket whose peer is its own address talks to itself; only the package
+// mechanism lifts the datagram limit.
+TEST_F(SocketTest, FailedConstructionLeavesTheObjectUsable) {
+  N_Socket socket;  // inert until constructed
+  socket.destruct();
+  EXPECT_EQ(0, registeredSockets());
+  N_Address unresolved("0.0.0.0");
+  for (auto [call, type] : {std::pair{Call::bind, N_Socket::SOCKET_TCP}, {Call::bind, N_Socket::SOCKET_UDP}, {Call::WSAConnect, N_Socket::SOCKET_TCP}}) {
+    EXPECT_THROW(socket.construct(&unresolved, port(), type), N_NetException_IPNotResolved*);
+    platform::fault::arm(call, {1, false, platform::WSAEADDRINUSE});
+    EXPECT_THROW(socket.construct(loopback(), port(), type), N_NetException_LocalAddressAlreadyInUse*);
+    EXPECT_FALSE(socket.isConnected());
+    EXPECT_EQ(0, registeredSockets());
+  }
+  socket.construct(loopback(), port(), N_Socket::SOCKET_UDP);
+  EXPECT_TRUE(socket.isConnected());
+  EXPECT_THROW(send(socket, pattern(65508, 1)), N_NetException_PacketTooBig*);
+  for (bool package : {false, true}) {
+    if (package) socket.enablePackage();
+    for (unsigned size : {0u, 100u, 65507u, package ? 70000u : 1u}) {
+      send(socket, pattern(size, size));
+      ASSERT_TRUE(nextMessage(socket, pattern(size, size))) << size;
+    }
+  }
+  socket.disablePackage();
+  N_Listener listener(port());
+  N_Socket in;
+  for (unsigned i = 0; i < 2; ++i) {  // constructing a live socket again drops the old connection and its unread message
+    ASSERT_TRUE(connectPair(listener, port(), in, socket));
+    EXPECT_EQ(2, registeredSockets());
+    send(socket, pattern(10, i));
+    ASSERT_TRUE(waitFor([&] { return in.getQueuedReceiveMessages() == 1; }));
+  }
+  ASSERT_TRUE(nextMessage(in, pattern(10, 1)));
+}
+
+// Whichever of disconnect() and the peer's close comes first reports; the
+// other finds nothing to do. Connect events are for outgoing sockets only.
+TEST_F(SocketTest, ConnectAndDisconnectEvents) {
+  N_Listener listener(port());
+  FlagSocket in, out;
+  ASSERT_TRUE(connectPair(listener, port(), in, out));
+  const N_Socket* reported = nullptr;
+  ASSERT_TRUE(waitFor([&] { return N_Socket::pollConnect(reported); }));
+  EXPECT_EQ(&out, reported);
+  EXPECT_FALSE(N_Socket::pollConnect(reported));
+  EXPECT_EQ(0, in.connects.load());
+  send(out, pattern(6, 1));
+  ASSERT_TRUE(waitFor([&] { return out.getBytesWaitingForSend() == 0; }));
+  out.disconnect();
+  out.disconnect();
+  EXPECT_FALSE(out.isConnected());
+  ASSERT_TRUE(waitFor([&] { return !in.isConnected(); }));
+  ASSERT_TRUE(nextMessage(in, pattern(6, 1)));  // the data in front of the close is still there
+  in.disconnect();
+  pumpFor(100, {});
+  EXPECT_EQ(1, out.disconnects.load());
+  EXPECT_EQ(1, in.disconnects.load());
+  std::vector<const N_Socket*> events;  // oldest socket first
+  while (N_Socket::pollDisconnect(reported)) events.push_back(reported);
+  EXPECT_EQ(std::vector<const N_Socket*>({&out, &in}), events);
+
+  // A handler answering false raises no event; a connect not yet polled when
+  // the disconnect comes shows only as the disconnect; a refused connect is silent.
+  for (bool keep : {true, false}) {
+    FlagSocket toRaw;
+    toRaw.keep = keep;
+    int fd = -1;
+    ASSERT_TRUE(connectRaw(toRaw, fd));
+    raw::closeFd(fd);
+    ASSERT_TRUE(waitFor([&] { return toRaw.disconnects == 1; }));
+    EXPECT_EQ(1, toRaw.connects.load());
+    EXPECT_FALSE(N_Socket::pollConnect(reported));
+    EXPECT_EQ(keep, waitFor([&] { return N_Socket::pollDisconnect(reported); }, keep ? 5000 : 100)) << keep;
+    EXPECT_TRUE(!keep || reported == &toRaw);
+  }
+  FlagSocket refused;
+  refused.construct(loopback(), freePort(), N_Socket::SOCKET_TCP);
+  EXPECT_TRUE(staysFalse([&] { return refused.isConnected() || N_Socket::pollConnect(reported) ||
+                                      N_Socket::pollDisconnect(reported) || refused.disconnects > 0; }, 200));
+}
+
+// receive() destroys its own socket, takes long while another thread
+// destroys it, or polls and declines, at the first of three messages of one
+// read: the rest is dropped, nothing touches a dead socket, destruct() waits
+// for the call, and a polled message is freed once (the balance tells).
+class BusySocket : public N_Socket {
+ public:
+  enum Mode { DESTRUCT, DELETE, SLOW, POLL } mode;
+  explicit BusySocket(Mode m) : mode(m) {}
+  ~BusySocket() { destruct(); }
+  bool receive(void* data, unsigned size) override {
+    ++calls;
+    const Mode m = mode;  // `this` may be gone below
+    void* polled;
+    unsigned polledSize;
+    if (m == DESTRUCT) destruct();
+    if (m == DELETE) delete this;
+    if (m == SLOW) platform::Sleep(200);
+    while (m == POLL && poll(polled, polledSize)) own += polled == data && polledSize == size;
+    ++finished;
+    return m != POLL;
+  }
+  static inline std::atomic<int> calls{0}, finished{0}, own{0};
+};
+
+TEST_F(SocketTest, ReceiveMayDestroyItsSocketOrPoll) {
+  N_Listener listener(port());
+  for (BusySocket::Mode mode : {BusySocket::DESTRUCT, BusySocket::DELETE, BusySocket::SLOW, BusySocket::POLL}) {
+    SCOPED_TRACE(mode);
+    BusySocket::calls = BusySocket::finished = BusySocket::own = 0;
+    auto* in = new BusySocket(mode);
+    int fd = -1;
+    ASSERT_TRUE(acceptRaw(listener, port(), *in, fd));
+    ASSERT_TRUE(rawSend(fd, concat({framed(pattern(5, 1)), framed(pattern(6, 2)), framed(pattern(7, 3))})));
+    ASSERT_TRUE(waitFor([&] { return BusySocket::calls == (mode == BusySocket::POLL ? 3 : 1); }));
+    if (mode == BusySocket::SLOW) in->destruct();  // waits for the calls under way
+    const int calls = BusySocket::calls;
+    EXPECT_TRUE(mode != BusySocket::SLOW || BusySocket::finished == calls);
+    pumpFor(50, {});
+    EXPECT_EQ(mode == BusySocket::SLOW ? calls : mode == BusySocket::POLL ? 3 : 1, BusySocket::calls.load());
+    EXPECT_EQ(calls, BusySocket::finished.load());
+    EXPECT_EQ(mode == BusySocket::POLL ? 3 : 0, BusySocket::own.load());
+    EXPECT_EQ(mode == BusySocket::POLL ? 1 : 0, registeredSockets());
+    if (mode != BusySocket::DELETE) delete in;
+    raw::closeFd(fd);
+  }
+}
+
+// Sends still queued and reads still under way when their socket goes: the
+// network side frees them once, and nothing reaches the wire.
+TEST_F(SocketTest, DestroyedSocketLeavesOrphansThatTheNetworkSideFrees) {
+  N_Socket probe;
+  {
+    N_Socket never(loopback(), freePort(), N_Socket::SOCKET_TCP);
+    for (unsigned i = 0; i < 10; ++i) send(never, pattern(1000, i));
+    EXPECT_EQ(10 * 1004, probe.getBytesWaitingForSend());
+  }
+  EXPECT_TRUE(waitFor([&] { return probe.getBytesWaitingForSend() == 0; }));
+  N_Listener listener(port());
+  for (unsigned round = 0; round < 10; ++round) {
+    N_Socket in;
+    int fd = -1;
+    ASSERT_TRUE(acceptRaw(listener, port(), in, fd));
+    const Bytes chunk = framed(pattern(50000, round));
+    std::atomic<bool> stop{false};
+    std::thread writer([&] { while (!stop && rawSend(fd, chunk)) {} });
+    platform::Sleep(5 + round * 3);
+    in.destruct();  // resets the connection: the writer's next send fails
+    stop = true;
+    writer.join();
+    raw::reset(fd);
+  }
+  // WSASends still out (the peer doesn't read) are aborted by the close.
+  N_Socket out;
+  int fd = -1;
+  ASSERT_TRUE(connectRaw(out, fd));
+  for (int i = 0; i < 600; ++i) send(out, pattern(60000, 1));  // more than loopback buffers hold
+  int last = -1;  // until the kernel takes no more
+  ASSERT_TRUE(waitFor([&] { const int now = probe.getBytesWaitingForSend(); return std::exchange(last, now) == now; }, 20000,
+                      [] { platform::Sleep(100); }));
+  ASSERT_GT(last, 0);
+  const unsigned queued = out.getQueuedSendMessages();  // each counted with its prefix
+  EXPECT_EQ(60004u * queued, out.getQueuedSendBytes());
+  raw::receiveFor(fd, 200);  // what the peer reads leaves the count
+  EXPECT_TRUE(waitFor([&] { return out.getQueuedSendMessages() < queued; }));
+  out.destruct();
+  EXPECT_TRUE(waitFor([&] { return probe.getBytesWaitingForSend() == 0; }, 10000));
+  raw::closeFd(fd);
+}
+
+// Each listener queues its own connections in order of arrival; pollConnect
+// gives the oldest entry until it is consumed, after receiveConnect heard of it.
+TEST_F(SocketTest, ListenersQueueTheirConnectionsInOrder) {
+  const int portB = freePort();
+  CountingListener a(port()), b(portB);
+  N_Socket::ConnectData* entry = nullptr;
+  const int toB1 = raw::connectFrom("127.0.0.2", "127.0.0.1", u16(portB));
+  ASSERT_TRUE(waitFor([&] { return b.calls == 1; }));
+  const int toA = raw::connectFrom("127.0.0.3", "127.0.0.1", u16(port()));
+  const int toB2 = raw::connectFrom("127.0.0.4", "127.0.0.1", u16(portB));
+  ASSERT_TRUE(waitFor([&] { return a.calls == 1 && b.calls == 2; }));
+  EXPECT_EQ(1, a.queuedFirst.load());
+  EXPECT_EQ(1, b.queuedFirst.load());  // b's second entry waits behind its first
+  std::vector<std::unique_ptr<N_Socket>> accepted;
+  struct Expected { CountingListener* listener; int fd; const char* from; };
+  for (auto [listener, fd, from] : {Expected{&b, toB1, "127.0.0.2"}, Expected{&a, toA, "127.0.0.3"}, Expected{&b, toB2, "127.0.0.4"}}) {
+    N_Socket::ConnectData* again = nullptr;
+    ASSERT_TRUE(listener->pollConnect(entry) && listener->pollConnect(again));
+    EXPECT_EQ(entry, again);
+    EXPECT_EQ(listener, entry->pListener);
+    N_Socket& in = *accepted.emplace_back(std::make_unique<N_Socket>(entry));
+    EXPECT_TRUE(in.isConnected() && in.getSocketType() == N_Socket::SOCKET_TCP);
+    EXPECT_EQ(raw_peer::localPort(fd), in.getPort());
+    EXPECT_STREQ(from, const_cast<const char*>(in.getAddress()->getStringNumber()));
+    raw::closeFd(fd);
+  }
+  EXPECT_FALSE(a.pollConnect(entry) || b.pollConnect(entry));
+}
+
+// A full accept queue stops accepting, so the process holds no more
+// connections than the bound; refusing entries lets the rest in.
+TEST_F(SocketTest, AFullAcceptQueueWaitsForTheApplication) {
+  N_Limits limits = N_Limits::defaults();
+  limits.uMaximumAcceptQueue = 3;
+  LimitsGuard guard(limits);
+  N_Listener listener(port());
+  const auto descriptors = [] {
+    return std::distance(std::filesystem::directory_iterator("/proc/self/fd"), std::filesystem::directory_iterator{});
+  };
+  const auto before = descriptors();
+  std::vector<int> peers;
+  for (int i = 0; i < 6; ++i) peers.push_back(raw::connectTo("127.0.0.1", u16(port())));
+  // Our 6 ends, and 3 accepted ones.
+  EXPECT_TRUE(waitFor([&] { return descriptors() - before == 9; }));
+  EXPECT_TRUE(staysFalse([&] { return descriptors() - before > 9; }, 300));
+  int refused = 0;
+  N_Socket::ConnectData* entry = nullptr;
+  while (refused < 6 && waitFor([&] { return listener.pollConnect(entry); })) refused += listener.rejectConnect(entry);
+  EXPECT_EQ(6, refused);
+  for (int fd : peers) {
+    EXPECT_TRUE(raw::closedByPeer(fd, 5000));
+    raw::closeFd(fd);
+  }
+}
+
+TEST_F(SocketTest, ListenerPortsOpenAndClose) {
+  const int newPort = freePort();  // constructed again a listener moves, destructed it closes
+  N_Socket::ConnectData* entry = nullptr;
+  auto listener = std::make_unique<N_Listener>(port());
+  listener->construct(newPort);
+  EXPECT_EQ(newPort, listener->getPort());
+  EXPECT_TRUE(portClosed(port()));
+  listener->destruct();
+  EXPECT_TRUE(portClosed(newPort));
+
+  // Entries nobody took stay with the runtime; a later listener on the port doesn't see them.
+  listener->construct(port());
+  const int waiting = raw::connectTo("127.0.0.1", u16(port()));
+  ASSERT_TRUE(waitFor([&] { return listener->pollConnect(entry); }));
+  listener.reset();
+  N_Listener again(port());
+  EXPECT_TRUE(staysFalse([&] { return again.pollConnect(entry); }, 100));
+  raw::closeFd(waiting);
+}
+
+// The network thread waits on at most 64 events: its release event, then
+// sockets oldest first, then listeners. What doesn't fit isn't served until
+// others go, but its sends still leave. With listeners first, none is left out.
+TEST_F(SocketTest, WaitSetServesSocketsFirstAndWhatDoesNotFitWaits) {
+  std::vector<std::unique_ptr<N_Socket>> sockets;
+  auto addSockets = [&](int n) {
+    while (n-- > 0) sockets.push_back(std::make_unique<N_Socket>(loopback(), freePort(), N_Socket::SOCKET_UDP));
+  };
+  std::vector<int> peers;
+  auto knock = [&](int p) { peers.push_back(raw::connectTo("127.0.0.1", u16(p))); };
+  addSockets(61);
+  const int portB = freePort();
+  CountingListener first(port()), second(portB);
+  knock(port());  // 1 + 61 + 2 = 64: all served
+  knock(portB);
+  EXPECT_TRUE(waitFor([&] { return first.calls == 1 && second.calls == 1; }));
+  addSockets(1);  // the younger listener is out
+  knock(portB);
+  knock(port());
+  EXPECT_TRUE(waitFor([&] { return first.calls == 2; }));
+  EXPECT_TRUE(staysFalse([&] { return second.calls > 1; }, 300));
+  addSockets(2);  // both listeners and the youngest socket are out
+  knock(port());
+  N_Socket& last = *sockets.back();
+  send(last, pattern(12, 1));
+  Bytes got;
+  EXPECT_FALSE(pollMessage(last, got, 300));
+  sockets.erase(sockets.begin());  // they move in, in order, as older sockets go
+  ASSERT_TRUE(nextMessage(last, pattern(12, 1)));
+  EXPECT_TRUE(staysFalse([&] { return first.calls > 2; }, 200));
+  sockets.erase(sockets.begin(), sockets.begin() + 2);
+  EXPECT_TRUE(waitFor([&] { return first.calls == 3 && second.calls == 2; }));
+  {
+    LimitsGuard open(N_Limits::openNetwork());  // listeners first
+    CountingListener third(freePort());
+    addSockets(10);
+    knock(third.getPort());
+    EXPECT_TRUE(waitFor([&] { return third.calls == 1; }));
+  }
+  sockets.clear();
+  for (int fd : peers) raw::closeFd(fd);
+}
+
+}  // namespace
