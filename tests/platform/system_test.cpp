@@ -71,7 +71,10 @@ TEST(Mutex, OneNameIsOneRecursiveMutexOwnedByAThread) {
   EXPECT_FALSE(ReleaseMutex(a)) << "released as often as taken";
   EXPECT_TRUE(CloseHandle(a));
   EXPECT_FALSE(CloseHandle(a));
-  std::thread([&] { EXPECT_EQ(WAIT_OBJECT_0, WaitForSingleObject(b, 0)) << "the other handle still works"; }).join();
+  std::thread([&] {
+    EXPECT_EQ(WAIT_OBJECT_0, WaitForSingleObject(b, 0)) << "the other handle still works";
+    EXPECT_TRUE(ReleaseMutex(b));
+  }).join();
   EXPECT_TRUE(CloseHandle(b) && CloseHandle(owned));
 }
 
