@@ -19,6 +19,9 @@ class ClientScriptedTest : public ClientServerTest {
   static Pump updating(N_Client& client) {
     return [&client] { client.update(); };
   }
+  static bool closedBoth(ScriptedServer& script) {
+    return waitFor([&] { return !script.connected(true) && !script.connected(false); }, 3000);
+  }
 };
 
 TEST_F(ClientScriptedTest, OpeningSendsRequestWorldTimeAndHeartbeatInOrder) {
@@ -37,17 +40,36 @@ TEST_F(ClientScriptedTest, OpeningSendsRequestWorldTimeAndHeartbeatInOrder) {
 
   ASSERT_TRUE(script.waitControl(5, 3000, updating(client)));
   const std::vector<Received> got = script.control();
-  EXPECT_EQ(CM::CONTROL_BANDWIDTH_REQUEST, got[0].type);
-  EXPECT_EQ(8u, got[0].size);
-  EXPECT_EQ(4321u, got[0].value);
-  EXPECT_EQ(CM::CONTROL_WORLD_TIME_REQUEST, got[1].type);
-  EXPECT_EQ(4u, got[1].size);
+  const std::pair<std::uint32_t, unsigned> opening[] = {
+      {CM::CONTROL_BANDWIDTH_REQUEST, 8}, {CM::CONTROL_WORLD_TIME_REQUEST, 4}, {CM::CONTROL_HEARTBEAT, 4}};
   // The heartbeat leaves from the first update nested in the wait.
-  EXPECT_EQ(CM::CONTROL_HEARTBEAT, got[2].type);
-  EXPECT_EQ(4u, got[2].size);
+  for (int i = 0; i < 3; ++i) {
+    EXPECT_EQ(opening[i].first, got[i].type) << i;
+    EXPECT_EQ(opening[i].second, got[i].size) << i;
+  }
+  EXPECT_EQ(4321u, got[0].value);
   EXPECT_EQ(3u, script.count(CM::CONTROL_WORLD_TIME_REQUEST));
   ASSERT_TRUE(waitFor([&] { return client.getLatency() > 0.0f; }, 2000, updating(client)));
   EXPECT_LT(client.getLatency(), 2.0f);
+
+  // Requests follow the channel; a dead one stores the value and sends nothing.
+  client.setBandwidth(999);
+  ASSERT_TRUE(waitFor([&] { return script.count(CM::CONTROL_BANDWIDTH_REQUEST) == 2; }, 2000));
+  EXPECT_EQ(999u, script.control().back().value);
+  client.disconnect();
+  client.disconnect();
+  EXPECT_FALSE(client.isConnected());
+  EXPECT_TRUE(closedBoth(script));
+  client.setBandwidth(55);
+  EXPECT_EQ(55u, client.getBandwidth());
+  pumpFor(100, updating(client));
+  EXPECT_FALSE(client.isConnected());  // nothing reconnects
+  EXPECT_EQ(2u, script.count(CM::CONTROL_BANDWIDTH_REQUEST));
+  // construct starts over from the default; destruct leaves 0.
+  client.construct(loopback(), port());
+  EXPECT_EQ(N_Client::DEFAULT_BANDWIDTH, client.getBandwidth());
+  client.destruct();
+  EXPECT_EQ(0u, client.getBandwidth());
 }
 
 TEST_F(ClientScriptedTest, ReceivedControlMessagesActByTypeAndSkipTheRest) {
@@ -59,6 +81,7 @@ TEST_F(ClientScriptedTest, ReceivedControlMessagesActByTypeAndSkipTheRest) {
   ASSERT_TRUE(script.waitControl(4, 2000, updating(client)));  // request and three world times
   const std::size_t opening = script.control().size();
   const float reply = Access::worldTimeReply(client);
+  EXPECT_EQ(N_Client::HEARTBEAT_SEND, Access::state(client));  // the machine is off
 
   // Too short for their type: dropped, not read past their end.
   script.sendControl(controlBytes(CM::CONTROL_BANDWIDTH_GRANT, 55, 4));
@@ -86,24 +109,19 @@ TEST_F(ClientScriptedTest, ReceivedControlMessagesActByTypeAndSkipTheRest) {
   pumpFor(150, updating(client));
   ASSERT_EQ(opening + 2, script.control().size());
   EXPECT_EQ(CM::CONTROL_HEARTBEAT_REPLY, script.control().back().type);
-  EXPECT_TRUE(client.isConnected());
-}
 
-TEST_F(ClientScriptedTest, HeartbeatReplyIsTakenInAnyState) {
-  heartbeat(0.0f, 0.2f);
-  ScriptedServer script(port());
-  N_Client client(loopback(), port());
-  ASSERT_TRUE(connect(client));
-  EXPECT_EQ(N_Client::HEARTBEAT_SEND, Access::state(client));  // the machine is off
+  // A heartbeat reply is taken in any state, and measures from the last
+  // heartbeat timer reset.
   Access::setHeartbeatAge(client, 0.3f);
   script.sendControl(controlBytes(CM::CONTROL_HEARTBEAT_REPLY));
   ASSERT_TRUE(waitFor([&] { return client.getLatency() > 0.0f; }, 2000, updating(client)));
   EXPECT_GE(client.getLatency(), 0.3f);
   EXPECT_EQ(N_Client::HEARTBEAT_AWAIT_PEER, Access::state(client));
+  EXPECT_TRUE(client.isConnected());
 }
 
-TEST_F(ClientScriptedTest, WorldTimerStopsAtTheFirstMissingReply) {
-  heartbeat(5.0f, 5.0f);  // slow: no heartbeat limit during the waits
+TEST_F(ClientScriptedTest, WorldTimerStopsAtTheFirstMissingReplyAndHeartbeatsGoOn) {
+  heartbeat(0.2f, 30.0f);  // beats go on, but no limit during the waits
   ScriptedServer script(port());
   script.worldTimeAnswers = 1;
   N_Client client(loopback(), port());
@@ -114,6 +132,10 @@ TEST_F(ClientScriptedTest, WorldTimerStopsAtTheFirstMissingReply) {
   EXPECT_GE(client.getWorldTimer().getAge(), 101.0f);
   EXPECT_LE(client.getWorldTimer().getAge(), 100.0 + secondsSince(start) + 0.05);
 
+  // The script sends no heartbeat of its own after this one, so only the
+  // client's own turn can add one during the next wait.
+  script.sendControl(controlBytes(CM::CONTROL_HEARTBEAT));
+  const std::size_t heartbeats = script.count(CM::CONTROL_HEARTBEAT);
   // Answers given, the server's time, result: none leaves the timer running
   // on; otherwise the last answer holds, and only three make it true.
   struct Case {
@@ -132,6 +154,9 @@ TEST_F(ClientScriptedTest, WorldTimerStopsAtTheFirstMissingReply) {
     const float base = k.answers == 0 ? before : k.value;
     EXPECT_GE(client.getWorldTimer().getAge(), base + (k.result ? 0.0f : 1.0f));
     EXPECT_LE(client.getWorldTimer().getAge(), base + took + 0.05);
+    if (k.answers == 0) {
+      EXPECT_GT(script.count(CM::CONTROL_HEARTBEAT), heartbeats);
+    }
   }
   // A dead channel fails after the same wait.
   client.disconnect();
@@ -140,152 +165,88 @@ TEST_F(ClientScriptedTest, WorldTimerStopsAtTheFirstMissingReply) {
   EXPECT_GE(secondsSince(start), 1.0);
 }
 
-TEST_F(ClientScriptedTest, HeartbeatRunsDuringTheWorldTimeWait) {
-  ScriptedServer script(port());
-  N_Client client(loopback(), port());
-  ASSERT_TRUE(connect(client));
-  script.worldTimeAnswers = 0;
-  // The script sends no heartbeat of its own after this one, so only the
-  // client's own turns show up, every 0.2 s or so.
-  script.sendControl(controlBytes(CM::CONTROL_HEARTBEAT));
-  const std::size_t before = script.count(CM::CONTROL_HEARTBEAT);
-  EXPECT_FALSE(client.updateWorldTimer());
-  EXPECT_GT(script.count(CM::CONTROL_HEARTBEAT), before);
-}
-
 // The limits of the heartbeat at 1 s / 1 s, with the timers set just below
-// and just above them.
-class ClientHeartbeatLimitTest : public ClientScriptedTest {
- protected:
-  void SetUp() override {
-    ClientScriptedTest::SetUp();
-    heartbeat(1.0f, 1.0f);
-  }
-  // Connected, the opening heartbeat answered: awaiting the peer's.
-  bool open(ScriptedServer& script, N_Client& client) {
-    if (!connect(client)) return false;
+// and just above them; each scenario on a connection of its own, its opening
+// heartbeat answered, awaiting the peer's.
+TEST_F(ClientScriptedTest, HeartbeatLimits) {
+  heartbeat(1.0f, 1.0f);
+  auto scenario = [&](const char* name, const std::function<void(ScriptedServer&, N_Client&)>& body) {
+    SCOPED_TRACE(name);
+    ScriptedServer script(port());
+    N_Client client(loopback(), port());
+    ASSERT_TRUE(connect(client));
     script.answerHeartbeats = false;
-    return waitFor([&] { return Access::state(client) == N_Client::HEARTBEAT_AWAIT_PEER; }, 2000, updating(client));
-  }
-  // The limit fires between `below` and `above` of the timer `set`.
-  static void expectLimit(N_Client& client, void (*set)(N_Client&, float), float below, float above) {
+    ASSERT_TRUE(waitFor([&] { return Access::state(client) == N_Client::HEARTBEAT_AWAIT_PEER; }, 2000,
+                        updating(client)));
+    body(script, client);
+  };
+  // The limit fires between `below` and `above` of the heartbeat timer.
+  auto expectLimit = [](N_Client& client, float below, float above) {
     const int state = Access::state(client);
-    set(client, below);
+    Access::setHeartbeatAge(client, below);
     client.update();
     EXPECT_TRUE(client.isConnected());
-    set(client, above);
+    Access::setHeartbeatAge(client, above);
     client.update();
     EXPECT_FALSE(client.isConnected());
     EXPECT_EQ(state, Access::state(client));
-  }
-};
-
-TEST_F(ClientHeartbeatLimitTest, AwaitPeerAllowsFrequencyPlusLatency) {
-  ScriptedServer script(port());
-  N_Client client(loopback(), port());
-  ASSERT_TRUE(open(script, client));
-  expectLimit(client, Access::setHeartbeatAge, 1.9f, 2.05f);
-  EXPECT_TRUE(waitFor([&] { return !script.connected(true) && !script.connected(false); }, 3000));
-}
-
-TEST_F(ClientHeartbeatLimitTest, IdleTurnsToSendAndTheReplyMayTakeTheLatency) {
-  ScriptedServer script(port());
-  N_Client client(loopback(), port());
-  ASSERT_TRUE(open(script, client));
-  script.sendControl(controlBytes(CM::CONTROL_HEARTBEAT));
-  ASSERT_TRUE(waitFor([&] { return Access::state(client) == N_Client::HEARTBEAT_IDLE; }, 2000, updating(client)));
-  const std::size_t heartbeats = script.count(CM::CONTROL_HEARTBEAT);
-  Access::setIdleAge(client, 0.9f);
-  client.update();
-  EXPECT_EQ(N_Client::HEARTBEAT_IDLE, Access::state(client));
-  Access::setIdleAge(client, 1.05f);
-  client.update();
-  EXPECT_EQ(N_Client::HEARTBEAT_SEND, Access::state(client));
-  sleepMs(100);
-  EXPECT_EQ(heartbeats, script.count(CM::CONTROL_HEARTBEAT));  // it leaves at the next step
-  client.update();
-  EXPECT_EQ(N_Client::HEARTBEAT_AWAIT_REPLY, Access::state(client));
-  ASSERT_TRUE(waitFor([&] { return script.count(CM::CONTROL_HEARTBEAT) == heartbeats + 1; }, 2000));
-  expectLimit(client, Access::setHeartbeatAge, 0.9f, 1.05f);
-  pumpFor(100, updating(client));
-  EXPECT_EQ(heartbeats + 1, script.count(CM::CONTROL_HEARTBEAT));
-}
-
-TEST_F(ClientHeartbeatLimitTest, AStalledApplicationIsDroppedEvenWithTheHeartbeatWaiting) {
-  ScriptedServer script(port());
-  N_Client client(loopback(), port());
-  ASSERT_TRUE(open(script, client));
-  // The peer's heartbeat arrives, but the step runs before the reading.
-  script.sendControl(controlBytes(CM::CONTROL_HEARTBEAT));
-  sleepMs(100);
-  Access::setHeartbeatAge(client, 2.05f);
-  client.update();
-  EXPECT_FALSE(client.isConnected());
-}
-
-TEST_F(ClientHeartbeatLimitTest, MachineOffAnswersButNeitherSendsNorTimesOut) {
-  ScriptedServer script(port());
-  N_Client client(loopback(), port());
-  ASSERT_TRUE(open(script, client));
-  const std::size_t heartbeats = script.count(CM::CONTROL_HEARTBEAT);
-  const float nan = std::numeric_limits<float>::quiet_NaN();
-  for (auto [f, l] : {std::pair{0.0f, 1.0f}, {1.0f, 0.0f}, {-1.0f, 1.0f}, {1.0f, -0.5f}, {nan, 1.0f}, {1.0f, nan}}) {
-    SCOPED_TRACE(testing::Message() << "frequency " << f << ", latency " << l);
-    heartbeat(f, l);
-    Access::setHeartbeatAge(client, 100.0f);
-    Access::setIdleAge(client, 100.0f);
+  };
+  scenario("awaiting the peer: frequency plus latency", [&](ScriptedServer& script, N_Client& client) {
+    expectLimit(client, 1.9f, 2.05f);
+    EXPECT_TRUE(closedBoth(script));
+  });
+  scenario("idle turns to send, the reply may take the latency", [&](ScriptedServer& script, N_Client& client) {
+    script.sendControl(controlBytes(CM::CONTROL_HEARTBEAT));
+    ASSERT_TRUE(
+        waitFor([&] { return Access::state(client) == N_Client::HEARTBEAT_IDLE; }, 2000, updating(client)));
+    const std::size_t heartbeats = script.count(CM::CONTROL_HEARTBEAT);
+    Access::setIdleAge(client, 0.9f);
     client.update();
-    EXPECT_TRUE(client.isConnected());
-  }
-  const std::size_t replies = script.count(CM::CONTROL_HEARTBEAT_REPLY);
-  script.sendControl(controlBytes(CM::CONTROL_HEARTBEAT));
-  ASSERT_TRUE(waitFor([&] { return script.count(CM::CONTROL_HEARTBEAT_REPLY) == replies + 1; }, 2000,
-                      updating(client)));
-  Access::setIdleAge(client, 100.0f);
-  pumpFor(100, updating(client));
-  EXPECT_EQ(N_Client::HEARTBEAT_IDLE, Access::state(client));
-  EXPECT_EQ(heartbeats, script.count(CM::CONTROL_HEARTBEAT));
-  // On again: the idle timer kept running, so the first step turns.
-  heartbeat(1.0f, 1.0f);
-  client.update();
-  EXPECT_EQ(N_Client::HEARTBEAT_SEND, Access::state(client));
-}
-
-TEST_F(ClientScriptedTest, BandwidthRequestsFollowTheChannel) {
-  ScriptedServer script(port());
-  N_Client client(loopback(), port());
-  ASSERT_TRUE(connect(client));
-  ASSERT_TRUE(script.waitControl(1, 2000, {}));
-  EXPECT_EQ(N_Client::DEFAULT_BANDWIDTH, script.control()[0].value);
-  client.setBandwidth(999);
-  EXPECT_EQ(999u, client.getBandwidth());
-  ASSERT_TRUE(waitFor([&] { return script.count(CM::CONTROL_BANDWIDTH_REQUEST) == 2; }, 2000));
-  EXPECT_EQ(999u, script.control().back().value);
-
-  // A dead channel: the value is stored and nothing is sent.
-  script.hangUp();
-  ASSERT_TRUE(waitFor([&] { return !client.isConnected(); }, 3000, updating(client)));
-  client.setBandwidth(55);
-  EXPECT_EQ(55u, client.getBandwidth());
-  sleepMs(100);
-  EXPECT_EQ(2u, script.count(CM::CONTROL_BANDWIDTH_REQUEST));
-  // construct starts over from the default; destruct leaves 0.
-  client.construct(loopback(), port());
-  EXPECT_EQ(N_Client::DEFAULT_BANDWIDTH, client.getBandwidth());
-  client.destruct();
-  EXPECT_EQ(0u, client.getBandwidth());
-}
-
-TEST_F(ClientScriptedTest, DisconnectClosesEveryChannelOnce) {
-  ScriptedServer script(port());
-  N_Client client(loopback(), port());
-  ASSERT_TRUE(connect(client));
-  client.disconnect();
-  client.disconnect();
-  EXPECT_FALSE(client.isConnected());
-  EXPECT_TRUE(waitFor([&] { return !script.connected(true) && !script.connected(false); }, 3000));
-  pumpFor(100, updating(client));
-  EXPECT_FALSE(client.isConnected());  // nothing reconnects
+    EXPECT_EQ(N_Client::HEARTBEAT_IDLE, Access::state(client));
+    Access::setIdleAge(client, 1.05f);
+    client.update();
+    EXPECT_EQ(N_Client::HEARTBEAT_SEND, Access::state(client));
+    sleepMs(100);
+    EXPECT_EQ(heartbeats, script.count(CM::CONTROL_HEARTBEAT));  // it leaves at the next step
+    client.update();
+    EXPECT_EQ(N_Client::HEARTBEAT_AWAIT_REPLY, Access::state(client));
+    ASSERT_TRUE(waitFor([&] { return script.count(CM::CONTROL_HEARTBEAT) == heartbeats + 1; }, 2000));
+    expectLimit(client, 0.9f, 1.05f);
+    pumpFor(100, updating(client));
+    EXPECT_EQ(heartbeats + 1, script.count(CM::CONTROL_HEARTBEAT));
+  });
+  scenario("a stalled application, the peer's heartbeat unread", [&](ScriptedServer& script, N_Client& client) {
+    // The step runs before the reading.
+    script.sendControl(controlBytes(CM::CONTROL_HEARTBEAT));
+    sleepMs(100);
+    Access::setHeartbeatAge(client, 2.05f);
+    client.update();
+    EXPECT_FALSE(client.isConnected());
+  });
+  scenario("switched off: answers but neither sends nor times out", [&](ScriptedServer& script, N_Client& client) {
+    const std::size_t heartbeats = script.count(CM::CONTROL_HEARTBEAT);
+    const float nan = std::numeric_limits<float>::quiet_NaN();
+    for (auto [f, l] : {std::pair{0.0f, 1.0f}, {1.0f, 0.0f}, {-1.0f, 1.0f}, {1.0f, -0.5f}, {nan, 1.0f}, {1.0f, nan}}) {
+      SCOPED_TRACE(testing::Message() << "frequency " << f << ", latency " << l);
+      heartbeat(f, l);
+      Access::setHeartbeatAge(client, 100.0f);
+      Access::setIdleAge(client, 100.0f);
+      client.update();
+      EXPECT_TRUE(client.isConnected());
+    }
+    const std::size_t replies = script.count(CM::CONTROL_HEARTBEAT_REPLY);
+    script.sendControl(controlBytes(CM::CONTROL_HEARTBEAT));
+    ASSERT_TRUE(waitFor([&] { return script.count(CM::CONTROL_HEARTBEAT_REPLY) == replies + 1; }, 2000,
+                        updating(client)));
+    Access::setIdleAge(client, 100.0f);
+    pumpFor(100, updating(client));
+    EXPECT_EQ(N_Client::HEARTBEAT_IDLE, Access::state(client));
+    EXPECT_EQ(heartbeats, script.count(CM::CONTROL_HEARTBEAT));
+    // On again: the idle timer kept running, so the first step turns.
+    heartbeat(1.0f, 1.0f);
+    client.update();
+    EXPECT_EQ(N_Client::HEARTBEAT_SEND, Access::state(client));
+  });
 }
 
 TEST_F(ClientScriptedTest, WithoutAServerOrAnAddress) {
@@ -330,31 +291,28 @@ TEST_F(ClientScriptedTest, WithoutAServerOrAnAddress) {
   EXPECT_THROW(empty.construct(&unresolved, port()), N_NetException_IPNotResolved*);
   EXPECT_FALSE(empty.isConstructed());
   EXPECT_EQ(0u, empty.getBandwidth());
-}
 
-// Each allocation of construct refused in turn until one constructs. (Not
-// a sweep: a socket whose construction failed is held by the runtime until
-// it stops; the balance at the end of the test counts it then.)
-TEST_F(ClientScriptedTest, AFailedConstructionLeavesNothing) {
-  N_Client client;
+  // Each allocation of construct refused in turn until one constructs. (Not
+  // a sweep: a socket whose construction failed is held by the runtime until
+  // it stops; the balance at the end of the test counts it then.)
   int failures = 0;
   for (int nth = 1; nth < 200; ++nth) {
     failAllocation(nth);
     try {
-      client.construct(loopback(), port());
+      empty.construct(loopback(), port());
     } catch (Q_MemoryException_Allocation*) {
       ++failures;
-      EXPECT_FALSE(client.isConstructed());
-      EXPECT_EQ(nullptr, client.getAddress());
+      EXPECT_FALSE(empty.isConstructed());
+      EXPECT_EQ(nullptr, empty.getAddress());
       continue;
     }
     const bool fired = platform::fault::allocationsFailed() > 0;  // maybe on the network thread
     disarmFaults();
     if (!fired) break;
-    client.destruct();
+    empty.destruct();
   }
   disarmFaults();
-  EXPECT_TRUE(client.isConstructed());
+  EXPECT_TRUE(empty.isConstructed());
   EXPECT_GE(failures, 4);  // two sockets and two queues at least
 }
 

@@ -134,33 +134,6 @@ TEST_P(ClientsTest, ExchangeAndLeave) {
 
 INSTANTIATE_TEST_SUITE_P(Count, ClientsTest, ::testing::Values(3, 20));
 
-TEST_F(ClientServerProcessTest, WorldTimerFollowsTheServer) {
-  heartbeat(5.0f, 5.0f);  // slow: the server stops answering below
-  N_Server server(port());
-  ServerPump pump(server);
-  PeerProcess peer(2, port(), {"--hb-frequency", "5", "--hb-latency", "5"});
-  ASSERT_NE(nullptr, peer.admit(pump));
-  peer.command("sync");
-  auto sync = peer.waitLine("sync", 10000, pump);
-  ASSERT_TRUE(sync);
-  ASSERT_EQ(0u, sync->find("sync 1 "));
-  // Every round trip of the exchange was shorter than the whole of it.
-  const double took = std::atof(sync->c_str() + 7);
-  const double before = server.getWorldTimer().getAge();
-  peer.command("time");
-  auto time = peer.waitLine("time", 5000, pump);
-  ASSERT_TRUE(time);
-  EXPECT_GE(valueOf(*time), before - took);
-  EXPECT_LE(valueOf(*time), server.getWorldTimer().getAge() + took);
-  // No answers: false after the one second of the first exchange.
-  peer.command("sync");
-  sync = peer.waitLine("sync", 10000);
-  ASSERT_TRUE(sync);
-  EXPECT_EQ(0u, sync->find("sync 0 ")) << *sync;
-  EXPECT_GE(std::atof(sync->c_str() + 7), 1.0);
-  EXPECT_LT(std::atof(sync->c_str() + 7), 2.0);
-}
-
 // With the real timers: a client that stops calling update is dropped by the
 // server, and a server that stops calling update by its client.
 TEST_F(ClientServerProcessTest, SilentEndsAreDropped) {
@@ -188,52 +161,15 @@ TEST_F(ClientServerProcessTest, SilentEndsAreDropped) {
   EXPECT_TRUE(waitFor([&] { return !cb->isConnected(); }, 3000, pump));
 }
 
-TEST_F(ClientServerProcessTest, SimulatedLossTakesUnreliableMessagesOnly) {
-  N_Server server(port());
-  ServerPump pump(server);
-  PeerProcess peer(2, port(), kSlowHeartbeat);
-  N_Client* client = peer.admit(pump);
-  ASSERT_NE(nullptr, client);
-  // Everything unreliable is lost, nothing reliable, and thrown away rather
-  // than left waiting.
-  N_Client::simulatePacketLoss(1.0f);
-  peer.command("send-u 30 u 5");
-  ASSERT_TRUE(peer.waitLine("sent 30", 10000, pump));
-  peer.command("send-r 30 r 5");
-  ASSERT_TRUE(peer.waitLine("sent 30", 10000, pump));
-  pumpFor(300, pump);
-  const std::vector<std::string> got = readPayloads(*client);
-  std::vector<int> thirty(30);
-  for (int i = 0; i < 30; ++i) thirty[i] = i;
-  EXPECT_EQ(thirty, indicesOf(got, 'r'));
-  EXPECT_TRUE(indicesOf(got, 'u').empty());
-  N_Client::simulatePacketLoss(0.0f);
-  EXPECT_TRUE(readPayloads(*client).empty());
-
-  // Half: the same seed keeps the same messages.
-  N_Client::simulatePacketLoss(0.5f);
-  std::vector<int> kept[2];
-  for (int round = 0; round < 2; ++round) {
-    const char prefix = round == 0 ? 'v' : 'w';
-    peer.command(std::string("send-u 40 ") + prefix + " 5");
-    ASSERT_TRUE(peer.waitLine("sent 40", 10000, pump));
-    pumpFor(300, pump);
-    platform::srand(4321);
-    kept[round] = indicesOf(readPayloads(*client), prefix);
-  }
-  EXPECT_EQ(kept[0], kept[1]);
-  EXPECT_GT(kept[0].size(), 0u);
-  EXPECT_LT(kept[0].size(), 40u);
-  EXPECT_TRUE(std::is_sorted(kept[0].begin(), kept[0].end()));
-  EXPECT_TRUE(peer.quit(10000, pump));
-}
-
-TEST_F(ClientServerProcessTest, UnreliableBatchesStayBelowTheDatagramLimit) {
+// One client host: datagram batches, simulated loss, then the world timer,
+// with a server that stops answering at the end.
+TEST_F(ClientServerProcessTest, OneClientOnItsOwnHost) {
+  heartbeat(5.0f, 5.0f);
   N_Server server(port());
   server.setBandwidth(4000000);  // room for the default request
   server.setMaximumBandwidthUsage(2000000);
   ServerPump pump(server);
-  PeerProcess peer(2, port(), kSlowHeartbeat);
+  PeerProcess peer(2, port(), {"--hb-frequency", "5", "--hb-latency", "5"});
   N_Client* client = peer.admit(pump);
   ASSERT_NE(nullptr, client);
   ASSERT_TRUE(peer.waitLine("bandwidth 1250000", 5000, pump));
@@ -263,6 +199,59 @@ TEST_F(ClientServerProcessTest, UnreliableBatchesStayBelowTheDatagramLimit) {
   peer.command("qun 0 1 " + std::to_string(largest) + " d");
   peer.command("fu");
   EXPECT_EQ(largest, nextDatagram().size());
+
+  // Simulated loss takes every unreliable message, nothing reliable, and
+  // throws them away rather than leaving them waiting.
+  N_Client::simulatePacketLoss(1.0f);
+  peer.command("send-u 30 u 5");
+  ASSERT_TRUE(peer.waitLine("sent 30", 10000, pump));
+  peer.command("send-r 30 r 5");
+  ASSERT_TRUE(peer.waitLine("sent 30", 10000, pump));
+  pumpFor(300, pump);
+  const std::vector<std::string> got = readPayloads(*client);
+  std::vector<int> thirty(30);
+  for (int i = 0; i < 30; ++i) thirty[i] = i;
+  EXPECT_EQ(thirty, indicesOf(got, 'r'));
+  EXPECT_TRUE(indicesOf(got, 'u').empty());
+  N_Client::simulatePacketLoss(0.0f);
+  EXPECT_TRUE(readPayloads(*client).empty());
+  // Half: the same seed keeps the same messages.
+  N_Client::simulatePacketLoss(0.5f);
+  std::vector<int> kept[2];
+  for (int round = 0; round < 2; ++round) {
+    const char prefix = round == 0 ? 'v' : 'w';
+    peer.command(std::string("send-u 40 ") + prefix + " 5");
+    ASSERT_TRUE(peer.waitLine("sent 40", 10000, pump));
+    pumpFor(300, pump);
+    platform::srand(4321);
+    kept[round] = indicesOf(readPayloads(*client), prefix);
+  }
+  EXPECT_EQ(kept[0], kept[1]);
+  EXPECT_GT(kept[0].size(), 0u);
+  EXPECT_LT(kept[0].size(), 40u);
+  EXPECT_TRUE(std::is_sorted(kept[0].begin(), kept[0].end()));
+  N_Client::simulatePacketLoss(0.0f);
+
+  // The world timer follows the server's: every round trip of the exchange
+  // was shorter than the whole of it.
+  peer.command("sync");
+  auto sync = peer.waitLine("sync", 10000, pump);
+  ASSERT_TRUE(sync);
+  ASSERT_EQ(0u, sync->find("sync 1 "));
+  const double took = std::atof(sync->c_str() + 7);
+  const double before = server.getWorldTimer().getAge();
+  peer.command("time");
+  auto time = peer.waitLine("time", 5000, pump);
+  ASSERT_TRUE(time);
+  EXPECT_GE(valueOf(*time), before - took);
+  EXPECT_LE(valueOf(*time), server.getWorldTimer().getAge() + took);
+  // No answers: false after the one second of the first exchange.
+  peer.command("sync");
+  sync = peer.waitLine("sync", 10000);
+  ASSERT_TRUE(sync);
+  EXPECT_EQ(0u, sync->find("sync 0 ")) << *sync;
+  EXPECT_GE(std::atof(sync->c_str() + 7), 1.0);
+  EXPECT_LT(std::atof(sync->c_str() + 7), 2.0);
   EXPECT_TRUE(peer.quit(10000, pump));
 }
 

@@ -119,14 +119,6 @@ bool ScriptedServer::waitControl(std::size_t count, int milliseconds, const Pump
   return waitFor([&] { return control().size() >= count; }, milliseconds, pump);
 }
 
-void ScriptedServer::hangUp() {
-  answerHeartbeats = false;
-  worldTimeAnswers = 0;
-  std::lock_guard<std::mutex> hold(m_lock);
-  if (m_pControl != nullptr) m_pControl->disconnect();
-  if (m_pData != nullptr) m_pData->disconnect();
-}
-
 // ---------------------------------------------------------------------------
 
 ScriptedClient::ScriptedClient(const N_Address* server, int port, bool openDataNow, bool openControlNow)
@@ -180,18 +172,6 @@ std::optional<std::uint32_t> ScriptedClient::lastGrant(const Pump& pump, int mil
 
 // ---------------------------------------------------------------------------
 
-N_Client* ServerPump::clientOf(const std::string& host, int milliseconds) const {
-  N_Client* found = nullptr;
-  waitFor(
-      [&] {
-        for (N_Client* c : announced())
-          if (hostOf(c) == host) found = c;
-        return found != nullptr;
-      },
-      milliseconds, *this);
-  return found;
-}
-
 N_Client* pairUp(const ServerPump& pump, ScriptedClient& client) {
   const std::size_t before = pump.announced().size();
   if (!waitFor([&] { return pump.announced().size() > before && client.connected(); }, 5000, pump)) {
@@ -226,7 +206,13 @@ bool PeerProcess::quit(int milliseconds, const Pump& pump) {
 }
 
 N_Client* PeerProcess::admit(const ServerPump& pump) {
-  if (waitLine("connected", 20000, pump)) return pump.clientOf(m_host);
+  N_Client* found = nullptr;
+  auto handedOut = [&] {
+    for (N_Client* c : pump.announced())
+      if (hostOf(c) == m_host) found = c;
+    return found != nullptr;
+  };
+  if (waitLine("connected", 20000, pump) && waitFor(handedOut, 5000, pump)) return found;
   std::string said;
   for (const std::string& line : m_process.lines()) said += "\n  " + line;
   ADD_FAILURE() << m_host << " did not connect; it said:" << said;

@@ -95,7 +95,6 @@ class ScriptedServer {
   bool sendControl(const std::vector<unsigned char>& bytes);
   bool sendData(const std::string& bytes);
   bool waitControl(std::size_t count, int milliseconds, const Pump& pump);
-  void hangUp();
 
  private:
   void run();
@@ -151,8 +150,6 @@ class ServerPump {
   }
   const std::vector<N_Client*>& announced() const { return *m_announced; }
   void forget(N_Client* client) const { std::erase(*m_announced, client); }
-  // The client handed out for `host`, waiting for it.
-  N_Client* clientOf(const std::string& host, int milliseconds = 5000) const;
 
  private:
   N_Server* m_pServer;

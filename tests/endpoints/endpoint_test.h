@@ -14,6 +14,13 @@
 #include "win32.h"
 #include "winsock.h"
 
+// Linux-side helpers that raw_socket.h doesn't give (raw_peer.cpp: Linux's
+// socket macros clash with the Winsock-shaped headers).
+namespace raw_peer {
+std::uint16_t localPort(int fd);
+void noDelay(int fd);  // small writes leave at once, each in a read of its own
+}  // namespace raw_peer
+
 // Feeds a read cut exactly so (or an error completion) to the receive path,
 // which loopback can't be made to do deterministically.
 struct N_SocketTestAccess {
@@ -53,13 +60,22 @@ inline bool pollMessage(N_Socket& s, Bytes& out, int milliseconds = 5000) {
   out.assign(static_cast<unsigned char*>(data), static_cast<unsigned char*>(data) + size);
   return true;
 }
-
 // The next message poll() gives within the time is `expected`.
 inline ::testing::AssertionResult nextMessage(N_Socket& s, const Bytes& expected, int milliseconds = 5000) {
   Bytes got;
   if (!pollMessage(s, got, milliseconds)) return ::testing::AssertionFailure() << "no message";
   if (got != expected) return ::testing::AssertionFailure() << got.size() << " bytes, not the " << expected.size() << " expected";
   return ::testing::AssertionSuccess();
+}
+// Nothing more to poll within the time.
+inline bool noMessage(N_Socket& s, int milliseconds = 100) {
+  Bytes got;
+  return !pollMessage(s, got, milliseconds);
+}
+// The socket of the next disconnect event within the time, null if none.
+inline const N_Socket* nextDisconnect(int milliseconds = 5000) {
+  const N_Socket* reported = nullptr;
+  return waitFor([&] { return N_Socket::pollDisconnect(reported); }, milliseconds) ? reported : nullptr;
 }
 
 // Keeps a copy of each message its receive() gets.
@@ -95,7 +111,6 @@ class CountingListener : public N_Listener {
 
 class EndpointTest : public RuntimeTest {
  protected:
-  static std::uint16_t u16(int port) { return static_cast<std::uint16_t>(port); }
   // `out` connects to `listener`, `in` takes the accepted end.
   bool connectPair(N_Listener& listener, int port, N_Socket& in, N_Socket& out) {
     out.construct(loopback(), port, N_Socket::SOCKET_TCP);
@@ -106,7 +121,7 @@ class EndpointTest : public RuntimeTest {
   }
   // A library socket accepted from a raw client `fd`.
   bool acceptRaw(N_Listener& listener, int port, N_Socket& in, int& fd) {
-    fd = raw::connectTo("127.0.0.1", u16(port));
+    fd = raw::connectTo("127.0.0.1", port);
     N_Socket::ConnectData* data = nullptr;
     if (fd < 0 || !waitFor([&] { return listener.pollConnect(data); })) return false;
     in.construct(data);
@@ -122,7 +137,7 @@ class EndpointTest : public RuntimeTest {
     return fd >= 0 && waitFor([&] { return out.isConnected(); });
   }
   static bool portClosed(int port) {
-    const int fd = raw::connectTo("127.0.0.1", u16(port));
+    const int fd = raw::connectTo("127.0.0.1", port);
     return raw::closeFd(fd), fd < 0;
   }
 };

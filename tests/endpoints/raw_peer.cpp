@@ -1,9 +1,10 @@
-#include "raw_peer.h"
-
+// The Linux-side helpers declared in endpoint_test.h.
 #include <arpa/inet.h>
 #include <netinet/in.h>
 #include <netinet/tcp.h>
 #include <sys/socket.h>
+
+#include <cstdint>
 
 namespace raw_peer {
 

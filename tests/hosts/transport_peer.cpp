@@ -1,12 +1,9 @@
-// A second host for the transport tests: on 127.0.0.2 it connects to the
-// test's listener on 127.0.0.1 port P over TCP, opens UDP on its own port
-// P + 1 towards the test's, and sends back every message on the socket it came
-// by until the TCP message "quit".
-//
-//   vardel_host_transport_peer --port P
-//
-// Exit code 0 after a clean quit; 2 if the test never showed up or went
-// silent; 3 on bad arguments or if the runtime or a socket couldn't be made.
+// A second host for the transport tests, `vardel_host_transport_peer --port P`:
+// on 127.0.0.2 it connects over TCP to the test's listener on 127.0.0.1:P,
+// opens UDP from its own P + 1 to the test's, and echoes every message on the
+// socket it came by until the TCP message "quit". Exit code 0 after a clean
+// quit; 2 if the test never showed up or went silent; 3 on bad arguments or
+// if the runtime or a socket couldn't be made.
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
@@ -31,22 +28,19 @@ int run(int port) {
   for (auto start = Clock::now(); !tcp.isConnected(); platform::Sleep(1))
     if (Clock::now() - start > std::chrono::seconds(20)) return 2;
   N_Socket udp(&test, port + 1, N_Socket::SOCKET_UDP);
-  bool quit = false;
-  for (auto lastHeard = Clock::now(); !quit;) {
+  for (auto lastHeard = Clock::now();;) {
     void* data = nullptr;
     unsigned size = 0;
-    if (tcp.poll(data, size)) {
-      quit = size == 4 && std::memcmp(data, "quit", 4) == 0;
-      if (!quit) tcp.send(data, size);
-    } else if (udp.poll(data, size)) {
-      udp.send(data, size);
+    N_Socket* from = tcp.poll(data, size) ? &tcp : udp.poll(data, size) ? &udp : nullptr;
+    if (from == &tcp && size == 4 && std::memcmp(data, "quit", 4) == 0) break;
+    if (from != nullptr) {
+      from->send(data, size);
+      lastHeard = Clock::now();
     } else if (!tcp.isConnected() || Clock::now() - lastHeard > std::chrono::seconds(30)) {
       return 2;
     } else {
       platform::Sleep(1);
-      continue;
     }
-    lastHeard = Clock::now();
   }
   // Everything sent leaves before the connection ends.
   for (auto start = Clock::now(); tcp.getBytesWaitingForSend() > 0 && Clock::now() - start < std::chrono::seconds(20);)

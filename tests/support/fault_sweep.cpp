@@ -1,12 +1,10 @@
 #include "fault_sweep.h"
 
-#include <chrono>
 #include <string>
-#include <thread>
 
 #include "N_Exceptions.h"
 #include "allocation_balance.h"
-#include "fault_guard.h"
+#include "guards.h"
 #include "runtime_test.h"
 
 namespace {
@@ -18,16 +16,6 @@ struct Fault {
   std::function<int()> fired;
   bool allocations;
 };
-
-// Resolver threads may give their blocks back a little after the run.
-bool settlesAt(const AllocationBalance& balance, int target) {
-  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-  while (balance.outstanding() != target) {
-    if (std::chrono::steady_clock::now() > deadline) return false;
-    std::this_thread::sleep_for(std::chrono::milliseconds(2));
-  }
-  return true;
-}
 
 ::testing::AssertionResult sweep(const Fault& fault, const std::function<void()>& scenario, int maxRuns) {
   for (int n = 1; n <= maxRuns; ++n) {
@@ -53,9 +41,8 @@ bool settlesAt(const AllocationBalance& balance, int target) {
     // A refused allocation is counted as made (Q_New counts every attempt).
     const int refused = fault.allocations ? hits : 0;
     RuntimeTest::noteRefused(refused);
-    if (!settlesAt(balance, refused))
-      return ::testing::AssertionFailure() << "run " << n << ": " << balance.outstanding() - refused
-                                           << " allocation(s) never given back";
+    if (::testing::AssertionResult settled = balance.settles(refused); !settled)
+      return ::testing::AssertionFailure() << "run " << n << ": " << settled.message();
     if (hits == 0) return ::testing::AssertionSuccess() << n << " runs";
   }
   return ::testing::AssertionFailure() << "the fault still fired after " << maxRuns << " runs";

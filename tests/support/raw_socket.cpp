@@ -29,10 +29,14 @@ bool readable(int fd, int timeoutMs) {
   return ::poll(&p, 1, timeoutMs) > 0;
 }
 
+// Address reuse lets a stream bind pass over connections in TIME_WAIT, but
+// not over a listener; without it a datagram bind fails beside any other.
 bool bindable(int type, std::uint16_t port) {
-  int fd = ::socket(AF_INET, type, 0);
+  int fd = ::socket(AF_INET, type | SOCK_CLOEXEC, 0);
+  int one = 1;
+  if (type == SOCK_STREAM) ::setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &one, sizeof one);
   sockaddr_in a = address("127.0.0.1", port);
-  bool ok = ::bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof a) == 0;
+  bool ok = ::bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof a) == 0 && (type != SOCK_STREAM || ::listen(fd, 1) == 0);
   ::close(fd);
   return ok;
 }
@@ -161,6 +165,8 @@ std::uint16_t freePort(bool pairWithNext) {
   }
   return 0;
 }
+
+bool portIsFree(std::uint16_t port) { return bindable(SOCK_STREAM, port) && bindable(SOCK_DGRAM, port); }
 
 bool closedByPeer(int fd, int timeoutMs) {
   auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMs);

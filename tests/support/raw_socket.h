@@ -32,7 +32,11 @@ void reset(int fd);
 void closeFd(int fd);
 // A UDP socket bound to ip:port; -1 on failure.
 int udpBound(const char* ip, std::uint16_t port);
-// A free port on 127.0.0.1 for both TCP and UDP (and for port + 1 when asked).
+// A free port on 127.0.0.1 for both TCP and UDP (and for port + 1 when asked),
+// claimed against the other test processes of the machine.
 std::uint16_t freePort(bool pairWithNext = false);
+// Nobody listens on TCP `port` and nobody holds UDP `port` (connections in
+// TIME_WAIT don't count): shows that a listener or datagram socket closed.
+bool portIsFree(std::uint16_t port);
 
 }  // namespace raw

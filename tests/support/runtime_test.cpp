@@ -2,7 +2,6 @@
 
 #include <thread>
 
-#include "Q_Memory.h"
 #include "fault.h"
 #include "raw_socket.h"
 #include "vardel_platform.h"
@@ -31,8 +30,7 @@ void RuntimeTest::SetUp() {
   platform::fault::disarmAll();
   m_iRefusalsSeen = platform::fault::allocationsFailed();
   platform::setLocalHost("127.0.0.1");
-  m_iNewBefore = Q_Memory::sm_iNewCount.load();
-  m_iDeleteBefore = Q_Memory::sm_iDeleteCount.load();
+  m_balance = AllocationBalance();
   m_runtime = std::make_unique<N_Initializer>();
   m_loopback = std::make_unique<N_Address>("127.0.0.1");
   // Its lookup is done before the test arms any fault.
@@ -47,8 +45,7 @@ void RuntimeTest::TearDown() {
   if (!m_bCheckBalance) return;
   // Resolver threads that nobody joins may still be giving back their blocks.
   const int refused = m_iRefused + sm_iNotedRefusals;
-  const bool balanced = waitFor([&] { return outstanding() == refused; }, 5000);
-  EXPECT_TRUE(balanced) << "library allocations not given back: " << outstanding() - refused;
+  EXPECT_TRUE(m_balance.settles(refused, 5.0));
 }
 
 void RuntimeTest::failAllocation(int nth, bool persist) {
@@ -65,10 +62,6 @@ void RuntimeTest::disarmFaults() {
 void RuntimeTest::stopRuntime() {
   m_loopback.reset();
   m_runtime.reset();
-}
-
-int RuntimeTest::outstanding() const {
-  return (Q_Memory::sm_iNewCount.load() - m_iNewBefore) - (Q_Memory::sm_iDeleteCount.load() - m_iDeleteBefore);
 }
 
 int RuntimeTest::freePort(bool pairWithNext) { return raw::freePort(pairWithNext); }

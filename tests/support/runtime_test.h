@@ -22,6 +22,7 @@
 
 #include "N_Address.h"
 #include "N_Initializer.h"
+#include "allocation_balance.h"
 
 using Clock = std::chrono::steady_clock;
 // Called on every turn of a wait, e.g. a server's update().
@@ -52,7 +53,7 @@ class RuntimeTest : public ::testing::Test {
   // Stops the runtime early (the balance is still checked at the end).
   void stopRuntime();
   // Library allocations made since SetUp and not given back.
-  int outstanding() const;
+  int outstanding() const { return m_balance.outstanding(); }
 
   const N_Address* loopback() const { return m_loopback.get(); }
   // A free port for TCP and UDP on 127.0.0.1, and port + 1 too.
@@ -67,8 +68,7 @@ class RuntimeTest : public ::testing::Test {
   std::unique_ptr<N_Initializer> m_runtime;
   std::unique_ptr<N_Address> m_loopback;
   int m_iPort = 0;
-  int m_iNewBefore = 0;
-  int m_iDeleteBefore = 0;
+  AllocationBalance m_balance;
   int m_iRefused = 0;
   int m_iRefusalsSeen = 0;
   static inline int sm_iNotedRefusals = 0;
