@@ -6,6 +6,7 @@
 #include "N_Initializer.h"
 #include "Q_New.h"
 #include "Q_Timer.h"
+#include "RuntimeLock.h"
 #include "win32.h"
 #include "winsock.h"
 
@@ -44,17 +45,6 @@ bool isNumberText(const char* text) {
   return true;
 }
 
-class AddressLock {
- public:
-  explicit AddressLock(HANDLE mutex) : m_hMutex(mutex) { WaitForSingleObject(m_hMutex, INFINITE); }
-  ~AddressLock() { ReleaseMutex(m_hMutex); }
-  AddressLock(const AddressLock&) = delete;
-  AddressLock& operator=(const AddressLock&) = delete;
-
- private:
-  HANDLE m_hMutex;
-};
-
 }  // namespace
 
 N_Address::N_Address() { initializeMembers(); }
@@ -81,7 +71,6 @@ bool N_Address::isConstructed() const { return m_bConstructed; }
 void N_Address::construct(const char* text) {
   destruct();
   if (text == nullptr) text = "";
-  bool holdingRuntime = false;
   try {
     m_bConstructed = true;
     // No other thread can see the block until its resolver starts, so it is
@@ -119,7 +108,7 @@ void N_Address::construct(const char* text) {
       } else {
         // The resolver may be done already; it clears m_pThread under the
         // lock, so only a resolver that still runs is remembered.
-        AddressLock hold(m_pShared->hMutex);
+        MutexHold hold(m_pShared->hMutex);
         if (m_pShared->iReferences > 1) m_pThread = thread;
       }
     }
@@ -127,17 +116,13 @@ void N_Address::construct(const char* text) {
     // The runtime's lists exist only while it is up; a stop deletes every
     // registered address, so an entry never outlives its list.
     if (N_Initializer::m_pAddresses != nullptr) {
-      WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
-      holdingRuntime = true;
+      RuntimeLock lock;
       N_Address** entry = N_Initializer::m_pAddresses->append();
       *entry = this;
       m_pRegistryEntry = entry;
       N_Initializer::releaseThreadLoop();
-      holdingRuntime = false;
-      ReleaseMutex(N_Initializer::m_hMutex);
     }
   } catch (...) {
-    if (holdingRuntime) ReleaseMutex(N_Initializer::m_hMutex);
     destruct();
     throw;
   }
@@ -150,11 +135,10 @@ void N_Address::destruct() {
   // never taken while the N_Address mutex is held, because the socket path
   // takes them the other way round.
   if (m_pRegistryEntry != nullptr) {
-    WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+    RuntimeLock lock;
     N_Initializer::m_pAddresses->remove(m_pRegistryEntry);
     m_pRegistryEntry = nullptr;
     N_Initializer::releaseThreadLoop();
-    ReleaseMutex(N_Initializer::m_hMutex);
   }
 
   if (m_pShared != nullptr) {
@@ -185,19 +169,19 @@ void N_Address::dropReference(SharedState* shared) {
 
 const volatile char* N_Address::getStringName() const {
   if (!m_bConstructed) return nullptr;
-  AddressLock hold(m_pShared->hMutex);
+  MutexHold hold(m_pShared->hMutex);
   return m_pName;
 }
 
 const volatile char* N_Address::getStringNumber() const {
   if (!m_bConstructed) return nullptr;
-  AddressLock hold(m_pShared->hMutex);
+  MutexHold hold(m_pShared->hMutex);
   return m_pNumber;
 }
 
 unsigned int N_Address::getIdentifier() const {
   if (!m_bConstructed) return 0;
-  AddressLock hold(m_pShared->hMutex);
+  MutexHold hold(m_pShared->hMutex);
   return m_uIdentifier;
 }
 
@@ -208,7 +192,7 @@ bool N_Address::fullyResolved() const {
 
 bool N_Address::lookupPending() const {
   if (!m_bConstructed) return false;
-  AddressLock hold(m_pShared->hMutex);
+  MutexHold hold(m_pShared->hMutex);
   return m_pShared->iReferences > 1;
 }
 
@@ -226,7 +210,7 @@ unsigned int N_Address::threadHostByName(void* parameter) {
   SharedState* shared = static_cast<SharedState*>(parameter);
   char* name = nullptr;
   {
-    AddressLock hold(shared->hMutex);
+    MutexHold hold(shared->hMutex);
     if (shared->pOwner != nullptr) {
       // Nothing may leave a thread: without a copy there is just no lookup.
       try {
@@ -265,7 +249,7 @@ unsigned int N_Address::threadHostByAddr(void* parameter) {
   SharedState* shared = static_cast<SharedState*>(parameter);
   unsigned int identifier = 0;
   {
-    AddressLock hold(shared->hMutex);
+    MutexHold hold(shared->hMutex);
     if (shared->pOwner != nullptr) identifier = shared->pOwner->m_uIdentifier;
   }
 

@@ -3,6 +3,7 @@
 #include <cstring>
 
 #include "N_Initializer.h"
+#include "RuntimeLock.h"
 #include "win32.h"
 #include "winsock.h"
 
@@ -41,7 +42,7 @@ bool N_Listener::isConstructed() const { return m_bConstructed; }
 
 void N_Listener::construct(int port) {
   if (m_bConstructed) destruct();
-  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  RuntimeLock lock;
   N_Initializer::releaseThreadLoop();
   m_iPort = port;
   m_event = WSACreateEvent();
@@ -72,17 +73,15 @@ void N_Listener::construct(int port) {
     N_Socket::chkErr(closesocket(m_socket));
     WSACloseEvent(m_event);
     initializeMembers();
-    ReleaseMutex(N_Initializer::m_hMutex);
     throw;
   }
   N_Initializer::releaseThreadLoop();
   m_bConstructed = true;
-  ReleaseMutex(N_Initializer::m_hMutex);
 }
 
 void N_Listener::destruct() {
   if (!m_bConstructed) return;
-  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  RuntimeLock lock;
   N_Initializer::releaseThreadLoop();
   N_Socket::chkErr(closesocket(m_socket));
   WSACloseEvent(m_event);
@@ -90,44 +89,36 @@ void N_Listener::destruct() {
     N_Initializer::m_pListeners->remove(m_pRegistryEntry);
   N_Initializer::releaseThreadLoop();
   initializeMembers();
-  ReleaseMutex(N_Initializer::m_hMutex);
 }
 
 int N_Listener::getPort() { return m_iPort; }
 
 bool N_Listener::pollConnect(N_Socket::ConnectData*& out) {
-  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
-  bool found = false;
+  RuntimeLock lock;
   Q_DLList<N_Socket::ConnectData>* queue = N_Initializer::m_pConnectQueue;
-  if (queue != nullptr) {
-    for (N_Socket::ConnectData* entry = queue->getFirst(); entry != nullptr; entry = queue->getNext(entry)) {
-      if (entry->pListener == this) {
-        out = entry;
-        found = true;
-        break;
-      }
+  if (queue == nullptr) return false;
+  for (N_Socket::ConnectData* entry = queue->getFirst(); entry != nullptr; entry = queue->getNext(entry)) {
+    if (entry->pListener == this) {
+      out = entry;
+      return true;
     }
   }
-  ReleaseMutex(N_Initializer::m_hMutex);
-  return found;
+  return false;
 }
 
 bool N_Listener::rejectConnect(N_Socket::ConnectData* data) {
-  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
-  bool found = false;
+  RuntimeLock lock;
   Q_DLList<N_Socket::ConnectData>* queue = N_Initializer::m_pConnectQueue;
   for (N_Socket::ConnectData* entry = queue != nullptr ? queue->getFirst() : nullptr; entry != nullptr;
        entry = queue->getNext(entry)) {
     if (entry != data || entry->pListener != this) continue;
     if (entry->socket != INVALID_SOCKET && entry->socket != 0) N_Socket::chkErr(closesocket(entry->socket));
     queue->remove(entry);
-    found = true;
     // The listener may have stopped accepting at a full queue.
     N_Initializer::releaseThreadLoop();
-    break;
+    return true;
   }
-  ReleaseMutex(N_Initializer::m_hMutex);
-  return found;
+  return false;
 }
 
 void N_Listener::receiveConnect(N_Socket::ConnectData*) {}

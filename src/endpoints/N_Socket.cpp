@@ -10,6 +10,7 @@
 #include "N_Initializer.h"
 #include "Q_New.h"
 #include "Q_Throw.h"
+#include "RuntimeLock.h"
 #include "win32.h"
 #include "winsock.h"
 
@@ -95,7 +96,7 @@ void N_Socket::baseConstructor() {
 
 void N_Socket::construct(ConnectData* data) {
   destruct();
-  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  RuntimeLock lock;
   try {
     baseConstructor();
     m_remoteAddress = data->address;
@@ -121,9 +122,8 @@ void N_Socket::construct(ConnectData* data) {
     m_pRegistryEntry = slot;
     N_Initializer::m_pConnectQueue->remove(data);
     N_Initializer::releaseThreadLoop();
-    ReleaseMutex(N_Initializer::m_hMutex);
   } catch (...) {
-    ReleaseMutex(N_Initializer::m_hMutex);
+    lock.unlock();
     destruct();
     throw;
   }
@@ -131,7 +131,7 @@ void N_Socket::construct(ConnectData* data) {
 
 void N_Socket::construct(const N_Address* address, int port, SocketType type) {
   destruct();
-  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  RuntimeLock lock;
   N_Initializer::releaseThreadLoop();
   try {
     baseConstructor();
@@ -178,9 +178,8 @@ void N_Socket::construct(const N_Address* address, int port, SocketType type) {
     *slot = this;
     m_pRegistryEntry = slot;
     N_Initializer::releaseThreadLoop();
-    ReleaseMutex(N_Initializer::m_hMutex);
   } catch (...) {
-    ReleaseMutex(N_Initializer::m_hMutex);
+    lock.unlock();
     destruct();
     throw;
   }
@@ -188,7 +187,7 @@ void N_Socket::construct(const N_Address* address, int port, SocketType type) {
 
 void N_Socket::destruct() {
   if (!m_bConstructed) return;
-  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  RuntimeLock lock;
   N_Initializer::releaseThreadLoop();
   awaitDelivery();
   chkErr(WSAEventSelect(m_socket, m_event, 0));
@@ -221,7 +220,6 @@ void N_Socket::destruct() {
     N_Initializer::m_pSockets->remove(m_pRegistryEntry);
   m_pRegistryEntry = nullptr;
   initializeMembers();
-  ReleaseMutex(N_Initializer::m_hMutex);
 }
 
 void N_Socket::disconnect() {
@@ -239,7 +237,7 @@ void N_Socket::disconnect() {
 }
 
 bool N_Socket::poll(void*& data, unsigned int& size) {
-  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  RuntimeLock lock;
   bool found = false;
   if (m_pReceiveQueue != nullptr) {
     DataQueue* entry = m_pReceiveQueue->getFirst();
@@ -268,7 +266,6 @@ bool N_Socket::poll(void*& data, unsigned int& size) {
     N_Initializer::m_bReadsToResume = true;
     N_Initializer::releaseThreadLoop();
   }
-  ReleaseMutex(N_Initializer::m_hMutex);
   return found;
 }
 
@@ -297,31 +294,23 @@ int N_Socket::getReceivePacketBytesMissing() const {
 }
 
 int N_Socket::getBytesWaitingForSend() const {
-  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
-  unsigned int sum = N_Initializer::m_uBytesWaitingForSend;
-  ReleaseMutex(N_Initializer::m_hMutex);
-  return static_cast<int>(sum);
+  RuntimeLock lock;
+  return static_cast<int>(N_Initializer::m_uBytesWaitingForSend);
 }
 
 unsigned int N_Socket::getQueuedSendBytes() const {
-  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
-  unsigned int bytes = m_uQueuedSendBytes;
-  ReleaseMutex(N_Initializer::m_hMutex);
-  return bytes;
+  RuntimeLock lock;
+  return m_uQueuedSendBytes;
 }
 
 unsigned int N_Socket::getQueuedSendMessages() const {
-  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
-  unsigned int messages = m_uQueuedSendMessages;
-  ReleaseMutex(N_Initializer::m_hMutex);
-  return messages;
+  RuntimeLock lock;
+  return m_uQueuedSendMessages;
 }
 
 unsigned int N_Socket::getQueuedReceiveMessages() const {
-  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
-  unsigned int messages = m_uQueuedReceiveMessages;
-  ReleaseMutex(N_Initializer::m_hMutex);
-  return messages;
+  RuntimeLock lock;
+  return m_uQueuedReceiveMessages;
 }
 
 std::uint64_t N_Socket::receiveBacklogCost() const {
@@ -329,10 +318,8 @@ std::uint64_t N_Socket::receiveBacklogCost() const {
 }
 
 unsigned int N_Socket::getQueuedReceiveBytes() const {
-  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
-  unsigned int bytes = m_uQueuedReceiveBytes;
-  ReleaseMutex(N_Initializer::m_hMutex);
-  return bytes;
+  RuntimeLock lock;
+  return m_uQueuedReceiveBytes;
 }
 
 N_Socket** N_Socket::getFirstSocket() {
@@ -345,19 +332,16 @@ N_Socket** N_Socket::getNextSocket(N_Socket** socket) {
 
 bool N_Socket::pollEvent(const N_Socket*& socket, bool connected) {
   if (N_Initializer::m_pSockets == nullptr) return false;
-  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
-  bool found = false;
+  RuntimeLock lock;
   Q_DLList<N_Socket*>* sockets = N_Initializer::m_pSockets;
   for (N_Socket** slot = sockets->getFirst(); slot != nullptr; slot = sockets->getNext(slot)) {
     N_Socket* candidate = *slot;
     if (candidate == nullptr || !candidate->m_bEventPending || candidate->m_bConnected != connected) continue;
     candidate->m_bEventPending = false;
     socket = candidate;
-    found = true;
-    break;
+    return true;
   }
-  ReleaseMutex(N_Initializer::m_hMutex);
-  return found;
+  return false;
 }
 
 bool N_Socket::pollConnect(const N_Socket*& socket) { return pollEvent(socket, true); }

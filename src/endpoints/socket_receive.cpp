@@ -19,6 +19,7 @@
 #include "N_Socket.h"
 #include "Q_New.h"
 #include "Q_System.h"
+#include "RuntimeLock.h"
 #include "win32.h"
 #include "winsock.h"
 
@@ -116,16 +117,17 @@ N_Socket::DataQueue* N_Socket::appendMessage(char* buffer, char* data, unsigned 
 
 bool N_Socket::deliver(DataQueue* read, DataQueue* message) {
   m_pDelivering = message;
-  ReleaseMutex(N_Initializer::m_hMutex);
   bool keep = true;
-  tl_bInReceive = true;
-  try {
-    keep = receive(message->wsaBuf.buf, message->wsaBuf.len);
-  } catch (...) {
-    keep = true;
+  {
+    RuntimeUnlock stepOut;
+    tl_bInReceive = true;
+    try {
+      keep = receive(message->wsaBuf.buf, message->wsaBuf.len);
+    } catch (...) {
+      keep = true;
+    }
+    tl_bInReceive = false;
   }
-  tl_bInReceive = false;
-  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
   // Only the override itself can have destroyed the socket meanwhile; then
   // the socket, this message and maybe the read buffer are gone.
   if (!read->bLive) return false;
@@ -142,9 +144,10 @@ bool N_Socket::deliver(DataQueue* read, DataQueue* message) {
 
 void N_Socket::awaitDelivery() {
   while (m_pDelivering != nullptr && !tl_bInReceive) {
-    ReleaseMutex(N_Initializer::m_hMutex);
-    Sleep(1);
-    WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+    {
+      RuntimeUnlock stepOut;
+      Sleep(1);
+    }
     // The network thread may have gone back to its wait meanwhile, on this
     // socket's event too: it must leave it before the event is closed.
     N_Initializer::releaseThreadLoop();
@@ -307,15 +310,14 @@ void N_Initializer::receiveComplete(DWORD error, DWORD bytes, OVERLAPPED* overla
     // nothing names its entry any more, so it goes now rather than at the
     // runtime's stop (a peer that resets connections again and again must
     // not make the queue grow).
-    WaitForSingleObject(m_hMutex, INFINITE);
+    RuntimeLock lock;
     Q_DeleteArray(read->pBuffer);
     read->pBuffer = nullptr;
     read->wsaBuf.buf = nullptr;
     m_pInProcessQueue->remove(read);
-    ReleaseMutex(m_hMutex);
     return;
   }
-  WaitForSingleObject(m_hMutex, INFINITE);
+  RuntimeLock lock;
   N_Socket* socket = read->pSocket;
   if (read->bLive && socket != nullptr) {
     unsigned int size = std::min<unsigned int>(bytes, read->wsaBuf.len);
@@ -330,12 +332,11 @@ void N_Initializer::receiveComplete(DWORD error, DWORD bytes, OVERLAPPED* overla
   read->pBuffer = nullptr;
   read->wsaBuf.buf = nullptr;
   m_pInProcessQueue->remove(read);
-  ReleaseMutex(m_hMutex);
 }
 
 void N_Socket::injectRead(N_Socket* socket, const void* bytes, unsigned int size, DWORD error) {
   size = std::min(size, kReadSize);
-  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  RuntimeLock lock;
   Q_DLList<DataQueue>* queue = N_Initializer::m_pInProcessQueue;
   DataQueue* entry = nullptr;
   try {
@@ -344,7 +345,6 @@ void N_Socket::injectRead(N_Socket* socket, const void* bytes, unsigned int size
     entry->pBuffer = Q_NewArray<char>(kReadSize);
   } catch (...) {
     if (entry != nullptr) queue->remove(entry);
-    ReleaseMutex(N_Initializer::m_hMutex);
     throw;
   }
   entry->wsaBuf.len = kReadSize;
@@ -357,6 +357,6 @@ void N_Socket::injectRead(N_Socket* socket, const void* bytes, unsigned int size
   entry->bLive = true;
   entry->pSocket = socket;
   if (size > 0) std::memcpy(entry->pBuffer, bytes, size);
-  ReleaseMutex(N_Initializer::m_hMutex);
+  lock.unlock();
   N_Initializer::receiveComplete(error, error == 0 ? size : 0, &entry->overlapped, 0);
 }

@@ -11,6 +11,7 @@
 #include "Q_New.h"
 #include "Q_System.h"
 #include "Q_Throw.h"
+#include "RuntimeLock.h"
 #include "win32.h"
 #include "winsock.h"
 
@@ -93,7 +94,7 @@ void N_Socket::send(void* data, unsigned int size) {
     throw;
   }
 
-  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  RuntimeLock lock;
   Q_DLList<DataQueue>* queue = N_Initializer::m_pOutProcessQueue;
   DataQueue* first = nullptr;
   std::size_t appended = 0;
@@ -111,7 +112,6 @@ void N_Socket::send(void* data, unsigned int size) {
     // Nothing of a message that failed stays queued.
     dropSendEntriesFrom(first);
     for (std::size_t i = appended; i < chunks.size(); ++i) Q_DeleteArray(chunks[i].buffer);
-    ReleaseMutex(N_Initializer::m_hMutex);
     throw;
   }
   for (const Chunk& c : chunks) {
@@ -121,7 +121,6 @@ void N_Socket::send(void* data, unsigned int size) {
   m_uQueuedSendMessages += static_cast<unsigned int>(chunks.size());
   if (N_Initializer::m_pPumpFrom == nullptr) N_Initializer::m_pPumpFrom = first;
   N_Initializer::releaseThreadLoop();
-  ReleaseMutex(N_Initializer::m_hMutex);
 }
 
 void N_Socket::sendComplete(DWORD dwError, DWORD cbTransferred, OVERLAPPED* lpOverlapped, DWORD dwFlags) {
@@ -140,7 +139,7 @@ void N_Socket::sendComplete(DWORD dwError, DWORD cbTransferred, OVERLAPPED* lpOv
     entry->bComplete = true;
     return;
   }
-  WaitForSingleObject(N_Initializer::m_hMutex, INFINITE);
+  RuntimeLock lock;
   Q_DeleteArray(entry->pBuffer);
   entry->pBuffer = nullptr;
   entry->wsaBuf.buf = nullptr;
@@ -156,5 +155,4 @@ void N_Socket::sendComplete(DWORD dwError, DWORD cbTransferred, OVERLAPPED* lpOv
   }
   if (N_Initializer::m_pPumpFrom == entry) N_Initializer::m_pPumpFrom = N_Initializer::m_pOutProcessQueue->getNext(entry);
   N_Initializer::m_pOutProcessQueue->remove(entry);
-  ReleaseMutex(N_Initializer::m_hMutex);
 }

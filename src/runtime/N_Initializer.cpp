@@ -6,6 +6,7 @@
 #include "Q_New.h"
 #include "Q_Throw.h"
 #include "Q_Timer.h"
+#include "RuntimeLock.h"
 #include "win32.h"
 #include "winsock.h"
 
@@ -202,8 +203,7 @@ void N_Initializer::stop() {
     // The thread writes THREAD_STOPPED just before its last release of the
     // mutex; taking it once makes sure that release is done before anything
     // below closes the mutex.
-    WaitForSingleObject(m_hMutex, INFINITE);
-    ReleaseMutex(m_hMutex);
+    RuntimeLock once;
   }
 
   Q_DeleteArray(reinterpret_cast<char*>(m_installedProtocols));
@@ -242,10 +242,9 @@ int N_Initializer::acceptConnection(WSABUF*, WSABUF*, _QualityOfService*, _Quali
 }
 
 unsigned int N_Initializer::threadNetwork(void*) {
-  // The stop clears m_hMutex after this thread has ended; its last release
-  // uses this copy.
-  HANDLE mutex = m_hMutex;
-  WaitForSingleObject(mutex, INFINITE);
+  // A copy of the handle: the stop clears m_hMutex after this thread has
+  // ended, and the last release comes after THREAD_STOPPED is written.
+  MutexHold hold(m_hMutex);
   m_threadState.store(THREAD_RUNNING);
 
   WSAEVENT events[kMaximumWaitEvents];
@@ -261,7 +260,7 @@ unsigned int N_Initializer::threadNetwork(void*) {
     } catch (...) {
       // Nothing may leave this thread; what failed is tried on the next pass.
     }
-    ReleaseMutex(mutex);
+    hold.unlock();
 
     // Completion routines run inside this wait and take the mutex themselves.
     DWORD result = WSAWaitForMultipleEvents(count, events, FALSE, timeout, TRUE);
@@ -276,7 +275,7 @@ unsigned int N_Initializer::threadNetwork(void*) {
       failedWaits = 0;
     }
 
-    WaitForSingleObject(mutex, INFINITE);
+    hold.lock();
     if (result == WSA_WAIT_EVENT_0) {
       WSAResetEvent(events[0]);
     } else if (result == WSA_WAIT_FAILED || result == WSA_WAIT_IO_COMPLETION || result == WSA_WAIT_TIMEOUT) {
@@ -291,8 +290,5 @@ unsigned int N_Initializer::threadNetwork(void*) {
   }
 
   m_threadState.store(THREAD_STOPPED);
-  // Fails harmlessly when the loop was left right after the wait, without
-  // the mutex.
-  ReleaseMutex(mutex);
   return 0;
 }

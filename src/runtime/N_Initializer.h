@@ -110,6 +110,7 @@ class VARDEL_API N_Initializer {
   friend class N_Client;
   friend class N_Server;
   friend class RuntimeLock;
+  friend class RuntimeUnlock;
 
   void start();
   static void stop();
