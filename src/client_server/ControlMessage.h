@@ -24,6 +24,8 @@
 #include <bit>
 #include <cstdint>
 
+#include "little_endian.h"
+
 struct ControlMessage {
   enum Type : std::uint32_t {
     CONTROL_BANDWIDTH_REQUEST = 1,
@@ -51,8 +53,8 @@ struct ControlMessage {
 
   // The wire form: `bytes` receives sizeOf(uType) bytes.
   void encode(unsigned char* bytes) const {
-    putWord(bytes, uType);
-    if (hasValue(uType)) putWord(bytes + 4, uValue);
+    little_endian::put32(bytes, uType);
+    if (hasValue(uType)) little_endian::put32(bytes + 4, uValue);
   }
 
   // Reads a received message. False for one too short for its type; uValue
@@ -60,11 +62,11 @@ struct ControlMessage {
   bool decode(const void* data, unsigned size) {
     if (data == nullptr || size < 4) return false;
     const auto* bytes = static_cast<const unsigned char*>(data);
-    uType = getWord(bytes);
+    uType = little_endian::get32(bytes);
     uValue = 0;
     if (hasValue(uType)) {
       if (size < 8) return false;
-      uValue = getWord(bytes + 4);
+      uValue = little_endian::get32(bytes + 4);
     }
     return true;
   }
@@ -72,15 +74,4 @@ struct ControlMessage {
   float floatValue() const { return std::bit_cast<float>(uValue); }
   static std::uint32_t floatBits(float value) { return std::bit_cast<std::uint32_t>(value); }
 
- private:
-  static void putWord(unsigned char* bytes, std::uint32_t word) {
-    bytes[0] = static_cast<unsigned char>(word);
-    bytes[1] = static_cast<unsigned char>(word >> 8);
-    bytes[2] = static_cast<unsigned char>(word >> 16);
-    bytes[3] = static_cast<unsigned char>(word >> 24);
-  }
-  static std::uint32_t getWord(const unsigned char* bytes) {
-    return std::uint32_t(bytes[0]) | std::uint32_t(bytes[1]) << 8 | std::uint32_t(bytes[2]) << 16 |
-           std::uint32_t(bytes[3]) << 24;
-  }
 };

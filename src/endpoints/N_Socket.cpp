@@ -363,59 +363,6 @@ int N_Socket::chkErr(int result) { return result; }
 SOCKET N_Socket::chkErr(SOCKET result) { return result; }
 
 const char* N_Socket::getWSErrorName(int code) {
-  switch (code) {
-    case 6: return "WSA_INVALID_HANDLE";
-    case 8: return "WSA_NOT_ENOUGH_MEMORY";
-    case 87: return "WSA_INVALID_PARAMETER";
-    case 995: return "WSA_OPERATION_ABORTED";
-    case 996: return "WSA_IO_INCOMPLETE";
-    case 997: return "WSA_IO_PENDING";
-    case 10004: return "WSAEINTR";
-    case 10013: return "WSAEACCES";
-    case 10014: return "WSAEFAULT";
-    case 10022: return "WSAEINVAL";
-    case 10024: return "WSAEMFILE";
-    case 10035: return "WSAEWOULDBLOCK";
-    case 10036: return "WSAEINPROGRESS";
-    case 10037: return "WSAEALREADY";
-    case 10038: return "WSAENOTSOCK";
-    case 10039: return "WSAEDESTADDRREQ";
-    case 10040: return "WSAEMSGSIZE";
-    case 10041: return "WSAEPROTOTYPE";
-    case 10042: return "WSAENOPROTOOPT";
-    case 10043: return "WSAEPROTONOSUPPORT";
-    case 10044: return "WSAESOCKTNOSUPPORT";
-    case 10045: return "WSAEOPNOTSUPP";
-    case 10046: return "WSAEPFNOSUPPORT";
-    case 10047: return "WSAEAFNOSUPPORT";
-    case 10048: return "WSAEADDRINUSE";
-    case 10049: return "WSAEADDRNOTAVAIL";
-    case 10050: return "WSAENETDOWN";
-    case 10051: return "WSAENETUNREACH";
-    case 10052: return "WSAENETRESET";
-    case 10053: return "WSAECONNABORTED";
-    case 10054: return "WSAECONNRESET";
-    case 10055: return "WSAENOBUFS";
-    case 10056: return "WSAEISCONN";
-    case 10057: return "WSAENOTCONN";
-    case 10058: return "WSAESHUTDOWN";
-    case 10060: return "WSAETIMEDOUT";
-    case 10061: return "WSAECONNREFUSED";
-    case 10064: return "WSAEHOSTDOWN";
-    case 10065: return "WSAEHOSTUNREACH";
-    case 10067: return "WSAEPROCLIM";
-    case 10091: return "WSASYSNOTREADY";
-    case 10092: return "WSAVERNOTSUPPORTED";
-    case 10093: return "WSANOTINITIALISED";
-    case 10101: return "WSAEDISCON";
-    case 10104: return "WSAEINVALIDPROCTABLE";
-    case 10105: return "WSAEINVALIDPROVIDER";
-    case 10106: return "WSAEPROVIDERFAILEDINIT";
-    case 10107: return "WSASYSCALLFAILURE";
-    case 11001: return "WSAHOST_NOT_FOUND";
-    case 11002: return "WSATRY_AGAIN";
-    case 11003: return "WSANO_RECOVERY";
-    case 11004: return "WSANO_DATA";
-    default: return "Undetermined error";
-  }
+  const char* name = wsaErrorName(code);
+  return name != nullptr ? name : "Undetermined error";
 }

@@ -19,6 +19,8 @@
 #include "N_Socket.h"
 #include "Q_New.h"
 #include "Q_System.h"
+#include "data_queue.h"
+#include "little_endian.h"
 #include "RuntimeLock.h"
 #include "win32.h"
 #include "winsock.h"
@@ -37,25 +39,14 @@ constexpr unsigned int kCompactBelow = 16384;
 // True on the network thread while it runs a receive() override.
 thread_local bool tl_bInReceive = false;
 
-std::uint32_t readLength(const char* at) {
-  const auto* b = reinterpret_cast<const unsigned char*>(at);
-  return std::uint32_t(b[0]) | std::uint32_t(b[1]) << 8 | std::uint32_t(b[2]) << 16 | std::uint32_t(b[3]) << 24;
-}
-
 }  // namespace
 
 void N_Socket::postRead() {
   Q_DLList<DataQueue>* queue = N_Initializer::m_pInProcessQueue;
   DataQueue* entry = nullptr;
   try {
-    entry = queue->append();
-    entry->pBuffer = nullptr;
-    entry->bIssued = true;
-    entry->bConsumed = false;
-    entry->bLive = true;
-    entry->pSocket = this;
+    entry = appendEntry(queue, this, true, false);
     entry->wsaBuf.len = kReadSize;
-    entry->wsaBuf.buf = nullptr;
     entry->pBuffer = Q_NewArray<char>(kReadSize);
     entry->wsaBuf.buf = entry->pBuffer;
   } catch (Q_MemoryException*) {
@@ -68,9 +59,7 @@ void N_Socket::postRead() {
     }
     return;
   }
-  std::memset(&entry->overlapped, 0, sizeof entry->overlapped);
   entry->overlapped.hEvent = entry;
-  entry->bComplete = false;
   DWORD received = 0;
   DWORD flags = 0;
   if (WSARecv(m_socket, &entry->wsaBuf, 1, &received, &flags, &entry->overlapped, N_Initializer::receiveComplete) ==
@@ -100,16 +89,10 @@ void N_Socket::breakStream() {
 }
 
 N_Socket::DataQueue* N_Socket::appendMessage(char* buffer, char* data, unsigned int size) {
-  DataQueue* message = m_pReceiveQueue->append();
+  DataQueue* message = appendEntry(m_pReceiveQueue, this, true, true);
   message->pBuffer = buffer;
   message->wsaBuf.len = size;
   message->wsaBuf.buf = data;
-  std::memset(&message->overlapped, 0, sizeof message->overlapped);
-  message->bIssued = true;
-  message->bComplete = true;
-  message->bConsumed = false;
-  message->bLive = true;
-  message->pSocket = this;
   m_uQueuedReceiveBytes += size;
   ++m_uQueuedReceiveMessages;
   return message;
@@ -218,7 +201,7 @@ bool N_Socket::receivePackaged(DataQueue* read, unsigned int bytes, const ReadLi
           m_iPacketBytesHave = static_cast<int>(left);
           return true;
         }
-        std::uint32_t length = readLength(cursor);
+        std::uint32_t length = little_endian::get32(cursor);
         if (length > limits.uMaximumLength) {
           breakStream();
           return true;
@@ -253,7 +236,7 @@ bool N_Socket::receivePackaged(DataQueue* read, unsigned int bytes, const ReadLi
         std::memcpy(m_pPacketBuffer + have, cursor, static_cast<std::size_t>(n));
         cursor += n;
         left -= n;
-        std::uint32_t length = readLength(m_pPacketBuffer);
+        std::uint32_t length = little_endian::get32(m_pPacketBuffer);
         if (length > limits.uMaximumLength) {
           breakStream();
           return true;
@@ -340,8 +323,7 @@ void N_Socket::injectRead(N_Socket* socket, const void* bytes, unsigned int size
   Q_DLList<DataQueue>* queue = N_Initializer::m_pInProcessQueue;
   DataQueue* entry = nullptr;
   try {
-    entry = queue->append();
-    entry->pBuffer = nullptr;
+    entry = appendEntry(queue, socket, true, false);
     entry->pBuffer = Q_NewArray<char>(kReadSize);
   } catch (...) {
     if (entry != nullptr) queue->remove(entry);
@@ -349,13 +331,7 @@ void N_Socket::injectRead(N_Socket* socket, const void* bytes, unsigned int size
   }
   entry->wsaBuf.len = kReadSize;
   entry->wsaBuf.buf = entry->pBuffer;
-  std::memset(&entry->overlapped, 0, sizeof entry->overlapped);
   entry->overlapped.hEvent = entry;
-  entry->bIssued = true;
-  entry->bComplete = false;
-  entry->bConsumed = false;
-  entry->bLive = true;
-  entry->pSocket = socket;
   if (size > 0) std::memcpy(entry->pBuffer, bytes, size);
   lock.unlock();
   N_Initializer::receiveComplete(error, error == 0 ? size : 0, &entry->overlapped, 0);

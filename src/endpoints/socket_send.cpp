@@ -10,7 +10,9 @@
 #include "N_Socket.h"
 #include "Q_New.h"
 #include "Q_System.h"
+#include "little_endian.h"
 #include "Q_Throw.h"
+#include "data_queue.h"
 #include "RuntimeLock.h"
 #include "win32.h"
 #include "winsock.h"
@@ -22,25 +24,6 @@ namespace {
 // A chunk keeps 16 bytes below the send limit, also the first one that
 // carries the prefix, so no single WSASend exceeds the socket's buffer.
 constexpr unsigned int kChunkReserve = 16;
-
-void prepare(N_Socket::DataQueue* entry, N_Socket* socket) {
-  entry->pBuffer = nullptr;
-  entry->wsaBuf.len = 0;
-  entry->wsaBuf.buf = nullptr;
-  std::memset(&entry->overlapped, 0, sizeof entry->overlapped);
-  entry->bIssued = false;
-  entry->bComplete = false;
-  entry->bConsumed = false;
-  entry->bLive = true;
-  entry->pSocket = socket;
-}
-
-void writeLength(char* to, std::uint32_t length) {
-  to[0] = static_cast<char>(length & 0xFF);
-  to[1] = static_cast<char>((length >> 8) & 0xFF);
-  to[2] = static_cast<char>((length >> 16) & 0xFF);
-  to[3] = static_cast<char>((length >> 24) & 0xFF);
-}
 
 }  // namespace
 
@@ -76,7 +59,7 @@ void N_Socket::send(void* data, unsigned int size) {
       chunks.reserve(size / chunkLimit + 1);
       chunks.push_back({Q_NewArray<char>(static_cast<std::size_t>(chunk) + 4), chunk + 4});
       // The whole message's size, however many chunks follow.
-      writeLength(chunks.back().buffer, size);
+      little_endian::put32(chunks.back().buffer, size);
       if (chunk > 0) std::memcpy(chunks.back().buffer + 4, bytes, chunk);
       for (unsigned int offset = chunk; offset < size;) {
         unsigned int c = size - offset < chunkLimit ? size - offset : chunkLimit;
@@ -100,8 +83,7 @@ void N_Socket::send(void* data, unsigned int size) {
   std::size_t appended = 0;
   try {
     for (const Chunk& c : chunks) {
-      DataQueue* entry = queue->append();
-      prepare(entry, this);
+      DataQueue* entry = appendEntry(queue, this, false, false);
       entry->pBuffer = c.buffer;
       entry->wsaBuf.buf = c.buffer;
       entry->wsaBuf.len = c.length;

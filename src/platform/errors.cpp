@@ -1,4 +1,5 @@
-// One table from errno to Winsock codes, and the per-thread last error.
+// The names of the Winsock codes, one table from errno to them, and the
+// per-thread last error.
 #include "internal.h"  // first: see the note there
 
 #include <cerrno>
@@ -16,6 +17,18 @@ std::uint32_t ntohl(std::uint32_t v) { return __builtin_bswap32(v); }
 
 int WSAGetLastError() { return t_lastError; }
 void WSASetLastError(int iError) { t_lastError = iError; }
+
+const char* wsaErrorName(int code) {
+  switch (code) {
+#define PLATFORM_WSA_NAME(name, value, named) \
+  case value:                                 \
+    return named ? #name : nullptr;
+    PLATFORM_WSA_ERRORS(PLATFORM_WSA_NAME)
+#undef PLATFORM_WSA_NAME
+    default:
+      return nullptr;
+  }
+}
 
 namespace detail {
 

@@ -38,60 +38,69 @@
 
 namespace platform {
 
-// Error codes, Winsock's values.
-constexpr int WSA_INVALID_HANDLE = 6;
-constexpr int WSA_NOT_ENOUGH_MEMORY = 8;
-constexpr int WSA_INVALID_PARAMETER = 87;
-constexpr int WSA_OPERATION_ABORTED = 995;
-constexpr int WSA_IO_INCOMPLETE = 996;
-constexpr int WSA_IO_PENDING = 997;
-constexpr int WSAEINTR = 10004;
-constexpr int WSAEBADF = 10009;
-constexpr int WSAEACCES = 10013;
-constexpr int WSAEFAULT = 10014;
-constexpr int WSAEINVAL = 10022;
-constexpr int WSAEMFILE = 10024;
-constexpr int WSAEWOULDBLOCK = 10035;
-constexpr int WSAEINPROGRESS = 10036;
-constexpr int WSAEALREADY = 10037;
-constexpr int WSAENOTSOCK = 10038;
-constexpr int WSAEDESTADDRREQ = 10039;
-constexpr int WSAEMSGSIZE = 10040;
-constexpr int WSAEPROTOTYPE = 10041;
-constexpr int WSAENOPROTOOPT = 10042;
-constexpr int WSAEPROTONOSUPPORT = 10043;
-constexpr int WSAESOCKTNOSUPPORT = 10044;
-constexpr int WSAEOPNOTSUPP = 10045;
-constexpr int WSAEPFNOSUPPORT = 10046;
-constexpr int WSAEAFNOSUPPORT = 10047;
-constexpr int WSAEADDRINUSE = 10048;
-constexpr int WSAEADDRNOTAVAIL = 10049;
-constexpr int WSAENETDOWN = 10050;
-constexpr int WSAENETUNREACH = 10051;
-constexpr int WSAENETRESET = 10052;
-constexpr int WSAECONNABORTED = 10053;
-constexpr int WSAECONNRESET = 10054;
-constexpr int WSAENOBUFS = 10055;
-constexpr int WSAEISCONN = 10056;
-constexpr int WSAENOTCONN = 10057;
-constexpr int WSAESHUTDOWN = 10058;
-constexpr int WSAETIMEDOUT = 10060;
-constexpr int WSAECONNREFUSED = 10061;
-constexpr int WSAEHOSTDOWN = 10064;
-constexpr int WSAEHOSTUNREACH = 10065;
-constexpr int WSAEPROCLIM = 10067;
-constexpr int WSASYSNOTREADY = 10091;
-constexpr int WSAVERNOTSUPPORTED = 10092;
-constexpr int WSANOTINITIALISED = 10093;
-constexpr int WSAEDISCON = 10101;
-constexpr int WSAEINVALIDPROCTABLE = 10104;
-constexpr int WSAEINVALIDPROVIDER = 10105;
-constexpr int WSAEPROVIDERFAILEDINIT = 10106;
-constexpr int WSASYSCALLFAILURE = 10107;
-constexpr int WSAHOST_NOT_FOUND = 11001;
-constexpr int WSATRY_AGAIN = 11002;
-constexpr int WSANO_RECOVERY = 11003;
-constexpr int WSANO_DATA = 11004;
+// Error codes: Winsock's name and value, and whether the library's error
+// names know it (a row of 0 has a constant but no name).
+#define PLATFORM_WSA_ERRORS(X) \
+  X(WSA_INVALID_HANDLE, 6, 1) \
+  X(WSA_NOT_ENOUGH_MEMORY, 8, 1) \
+  X(WSA_INVALID_PARAMETER, 87, 1) \
+  X(WSA_OPERATION_ABORTED, 995, 1) \
+  X(WSA_IO_INCOMPLETE, 996, 1) \
+  X(WSA_IO_PENDING, 997, 1) \
+  X(WSAEINTR, 10004, 1) \
+  X(WSAEBADF, 10009, 0) \
+  X(WSAEACCES, 10013, 1) \
+  X(WSAEFAULT, 10014, 1) \
+  X(WSAEINVAL, 10022, 1) \
+  X(WSAEMFILE, 10024, 1) \
+  X(WSAEWOULDBLOCK, 10035, 1) \
+  X(WSAEINPROGRESS, 10036, 1) \
+  X(WSAEALREADY, 10037, 1) \
+  X(WSAENOTSOCK, 10038, 1) \
+  X(WSAEDESTADDRREQ, 10039, 1) \
+  X(WSAEMSGSIZE, 10040, 1) \
+  X(WSAEPROTOTYPE, 10041, 1) \
+  X(WSAENOPROTOOPT, 10042, 1) \
+  X(WSAEPROTONOSUPPORT, 10043, 1) \
+  X(WSAESOCKTNOSUPPORT, 10044, 1) \
+  X(WSAEOPNOTSUPP, 10045, 1) \
+  X(WSAEPFNOSUPPORT, 10046, 1) \
+  X(WSAEAFNOSUPPORT, 10047, 1) \
+  X(WSAEADDRINUSE, 10048, 1) \
+  X(WSAEADDRNOTAVAIL, 10049, 1) \
+  X(WSAENETDOWN, 10050, 1) \
+  X(WSAENETUNREACH, 10051, 1) \
+  X(WSAENETRESET, 10052, 1) \
+  X(WSAECONNABORTED, 10053, 1) \
+  X(WSAECONNRESET, 10054, 1) \
+  X(WSAENOBUFS, 10055, 1) \
+  X(WSAEISCONN, 10056, 1) \
+  X(WSAENOTCONN, 10057, 1) \
+  X(WSAESHUTDOWN, 10058, 1) \
+  X(WSAETIMEDOUT, 10060, 1) \
+  X(WSAECONNREFUSED, 10061, 1) \
+  X(WSAEHOSTDOWN, 10064, 1) \
+  X(WSAEHOSTUNREACH, 10065, 1) \
+  X(WSAEPROCLIM, 10067, 1) \
+  X(WSASYSNOTREADY, 10091, 1) \
+  X(WSAVERNOTSUPPORTED, 10092, 1) \
+  X(WSANOTINITIALISED, 10093, 1) \
+  X(WSAEDISCON, 10101, 1) \
+  X(WSAEINVALIDPROCTABLE, 10104, 1) \
+  X(WSAEINVALIDPROVIDER, 10105, 1) \
+  X(WSAEPROVIDERFAILEDINIT, 10106, 1) \
+  X(WSASYSCALLFAILURE, 10107, 1) \
+  X(WSAHOST_NOT_FOUND, 11001, 1) \
+  X(WSATRY_AGAIN, 11002, 1) \
+  X(WSANO_RECOVERY, 11003, 1) \
+  X(WSANO_DATA, 11004, 1)
+
+#define PLATFORM_WSA_CONSTANT(name, value, named) constexpr int name = value;
+PLATFORM_WSA_ERRORS(PLATFORM_WSA_CONSTANT)
+#undef PLATFORM_WSA_CONSTANT
+
+// The constant's name of a named error code; nullptr for any other value.
+const char* wsaErrorName(int code);
 
 // Address families, socket types, protocols (Winsock's values).
 constexpr int AF_UNSPEC = 0;
