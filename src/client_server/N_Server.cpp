@@ -7,6 +7,7 @@
 #include "Q_Mutex.h"
 #include "Q_New.h"
 #include "RuntimeLock.h"
+#include "trace.h"
 
 N_Server::N_Server(int port) : N_Listener(port) {
   initializeMembers();
@@ -356,6 +357,7 @@ void N_Server::disconnectClient(N_Client* client) {
         freeClient(client);
       } catch (...) {
         // A derived freeClient that fails loses its object, not the list.
+        traceSwallowed("freeClient");
       }
       *entry = nullptr;
       m_pClients->remove(entry);

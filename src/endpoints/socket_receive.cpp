@@ -20,6 +20,7 @@
 #include "Q_New.h"
 #include "Q_System.h"
 #include "data_queue.h"
+#include "trace.h"
 #include "little_endian.h"
 #include "RuntimeLock.h"
 #include "win32.h"
@@ -56,6 +57,7 @@ void N_Socket::postRead() {
     try {
       disconnect();
     } catch (...) {
+      traceSwallowed("disconnect after a failed read");
     }
     return;
   }
@@ -85,6 +87,7 @@ void N_Socket::breakStream() {
   try {
     disconnect();
   } catch (...) {
+    traceSwallowed("disconnect of a broken stream");
   }
 }
 
@@ -107,6 +110,7 @@ bool N_Socket::deliver(DataQueue* read, DataQueue* message) {
     try {
       keep = receive(message->wsaBuf.buf, message->wsaBuf.len);
     } catch (...) {
+      traceSwallowed("receive");
       keep = true;
     }
     tl_bInReceive = false;

@@ -2,6 +2,10 @@
 
 #include <cstdarg>
 #include <cstdio>
+#include <exception>
+
+#include "Q_Exception.h"
+#include "trace.h"
 
 Q_String::Q_String() = default;
 Q_String::Q_String(const char* text) { assign(text, text != nullptr ? std::char_traits<char>::length(text) : 0); }
@@ -82,3 +86,16 @@ struct InitPair {
 };
 InitPair g_initPairs[3];
 }  // namespace
+
+void traceSwallowed(const char* where) {
+  const char* what = "an exception that is not the library's";
+  try {
+    throw;
+  } catch (Q_Exception* e) {
+    if (e != nullptr && e->getErrorMessage() != nullptr) what = e->getErrorMessage();
+  } catch (const std::exception& e) {
+    what = e.what();
+  } catch (...) {
+  }
+  Sys->verbose("%s: %s (caught and dropped)", where, what);
+}

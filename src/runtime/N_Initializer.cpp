@@ -7,6 +7,7 @@
 #include "Q_Throw.h"
 #include "Q_Timer.h"
 #include "RuntimeLock.h"
+#include "trace.h"
 #include "win32.h"
 #include "winsock.h"
 
@@ -259,6 +260,7 @@ unsigned int N_Initializer::threadNetwork(void*) {
       pumpSends();
     } catch (...) {
       // Nothing may leave this thread; what failed is tried on the next pass.
+      traceSwallowed("network pass");
     }
     hold.unlock();
 
@@ -285,6 +287,7 @@ unsigned int N_Initializer::threadNetwork(void*) {
         serveEvent(events[result]);
       } catch (...) {
         // An allocation that failed while serving costs that event only.
+        traceSwallowed("network event");
       }
     }
   }

@@ -8,6 +8,7 @@
 #include "N_Listener.h"
 #include "N_Socket.h"
 #include "Q_New.h"
+#include "trace.h"
 #include "win32.h"
 #include "winsock.h"
 
@@ -151,6 +152,7 @@ void N_Initializer::serveEvent(WSAEVENT handle) {
       try {
         keep = socket->receiveConnect();
       } catch (...) {
+        traceSwallowed("receiveConnect");
       }
       if (keep) socket->m_bEventPending = true;
     }
@@ -168,6 +170,7 @@ void N_Initializer::serveEvent(WSAEVENT handle) {
       try {
         socket->disconnect();
       } catch (...) {
+        traceSwallowed("disconnect at FD_CLOSE");
       }
     }
   }
@@ -209,6 +212,7 @@ void N_Initializer::serveEvent(WSAEVENT handle) {
     try {
       listener->receiveConnect(entry);
     } catch (...) {
+      traceSwallowed("N_Listener::receiveConnect");
     }
   }
 }
