@@ -13,7 +13,6 @@
 // The name service calls below are written with their namespace: the C
 // library's functions of the same names may be visible through standard
 // headers.
-using namespace platform;
 
 namespace {
 
@@ -76,7 +75,7 @@ void N_Address::construct(const char* text) {
     // No other thread can see the block until its resolver starts, so it is
     // filled without the lock.
     m_pShared = Q_New<SharedState>();
-    m_pShared->hMutex = CreateMutexA(nullptr, FALSE, kAddressMutexName);
+    m_pShared->hMutex = platform::CreateMutexA(nullptr, platform::FALSE, kAddressMutexName);
     m_pShared->iReferences = 1;
     m_pShared->pOwner = this;
     m_pName = nullptr;
@@ -84,7 +83,7 @@ void N_Address::construct(const char* text) {
     m_uIdentifier = 0;
     m_pThread = nullptr;
 
-    AFX_THREADPROC resolver;
+    platform::AFX_THREADPROC resolver;
     if (isNumberText(text)) {
       m_pNumber = copyString(text);
       m_uIdentifier = platform::inet_addr(text);
@@ -101,7 +100,7 @@ void N_Address::construct(const char* text) {
     if (m_pShared->hMutex != nullptr && (maximumLookups == 0 || g_uLookups.load() < maximumLookups)) {
       ++m_pShared->iReferences;
       ++g_uLookups;
-      CWinThread* thread = AfxBeginThread(resolver, m_pShared, 0, 0, 0, nullptr);
+      platform::CWinThread* thread = platform::AfxBeginThread(resolver, m_pShared, 0, 0, 0, nullptr);
       if (thread == nullptr) {
         --g_uLookups;
         --m_pShared->iReferences;  // no resolver to drop it
@@ -143,7 +142,7 @@ void N_Address::destruct() {
 
   if (m_pShared != nullptr) {
     SharedState* shared = m_pShared;
-    WaitForSingleObject(shared->hMutex, INFINITE);
+    platform::WaitForSingleObject(shared->hMutex, platform::INFINITE);
     freeString(m_pName);
     freeString(m_pNumber);
     shared->pOwner = nullptr;
@@ -157,13 +156,13 @@ void N_Address::destruct() {
 }
 
 void N_Address::dropReference(SharedState* shared) {
-  HANDLE mutex = shared->hMutex;
+  platform::HANDLE mutex = shared->hMutex;
   if (--shared->iReferences == 0) {
-    ReleaseMutex(mutex);
-    if (mutex != nullptr) CloseHandle(mutex);
+    platform::ReleaseMutex(mutex);
+    if (mutex != nullptr) platform::CloseHandle(mutex);
     Q_Delete(shared);
   } else {
-    ReleaseMutex(mutex);
+    platform::ReleaseMutex(mutex);
   }
 }
 
@@ -221,13 +220,13 @@ unsigned int N_Address::threadHostByName(void* parameter) {
     }
   }
 
-  hostent* host = name != nullptr ? platform::gethostbyname(name) : nullptr;
+  platform::hostent* host = name != nullptr ? platform::gethostbyname(name) : nullptr;
 
-  WaitForSingleObject(shared->hMutex, INFINITE);
+  platform::WaitForSingleObject(shared->hMutex, platform::INFINITE);
   N_Address* owner = shared->pOwner;
   if (owner != nullptr) {
     if (host != nullptr && host->h_addr_list != nullptr && host->h_addr_list[0] != nullptr) {
-      in_addr address;
+      platform::in_addr address;
       std::memcpy(&address.s_addr, host->h_addr_list[0], sizeof address.s_addr);
       try {
         char* number = copyString(platform::inet_ntoa(address));
@@ -253,11 +252,11 @@ unsigned int N_Address::threadHostByAddr(void* parameter) {
     if (shared->pOwner != nullptr) identifier = shared->pOwner->m_uIdentifier;
   }
 
-  hostent* host = identifier != 0
-                      ? platform::gethostbyaddr(reinterpret_cast<const char*>(&identifier), sizeof identifier, AF_INET)
-                      : nullptr;
+  platform::hostent* host = identifier != 0 ? platform::gethostbyaddr(reinterpret_cast<const char*>(&identifier),
+                                                                      sizeof identifier, platform::AF_INET)
+                                            : nullptr;
 
-  WaitForSingleObject(shared->hMutex, INFINITE);
+  platform::WaitForSingleObject(shared->hMutex, platform::INFINITE);
   N_Address* owner = shared->pOwner;
   if (owner != nullptr) {
     if (host != nullptr && host->h_name != nullptr && owner->m_pName == nullptr) {

@@ -7,14 +7,12 @@
 #include "win32.h"
 #include "winsock.h"
 
-using namespace platform;
-
 namespace {
 
 constexpr int kBufferSize = 65536;
 
-void setIntOption(SOCKET s, int option, int value) {
-  setsockopt(s, SOL_SOCKET, option, reinterpret_cast<const char*>(&value), sizeof value);
+void setIntOption(platform::SOCKET s, int option, int value) {
+  platform::setsockopt(s, platform::SOL_SOCKET, option, reinterpret_cast<const char*>(&value), sizeof value);
 }
 
 }  // namespace
@@ -45,33 +43,36 @@ void N_Listener::construct(int port) {
   RuntimeLock lock;
   N_Initializer::releaseThreadLoop();
   m_iPort = port;
-  m_event = WSACreateEvent();
-  WSAPROTOCOL_INFOA* provider = N_Initializer::m_tcpProtocol;
-  m_requestedAddress.sin_family = static_cast<std::uint16_t>(provider != nullptr ? provider->iAddressFamily : AF_INET);
-  m_requestedAddress.sin_port = htons(static_cast<std::uint16_t>(port));
-  m_requestedAddress.sin_addr.s_addr = INADDR_ANY;
+  m_event = platform::WSACreateEvent();
+  platform::WSAPROTOCOL_INFOA* provider = N_Initializer::m_tcpProtocol;
+  m_requestedAddress.sin_family =
+      static_cast<std::uint16_t>(provider != nullptr ? provider->iAddressFamily : platform::AF_INET);
+  m_requestedAddress.sin_port = platform::htons(static_cast<std::uint16_t>(port));
+  m_requestedAddress.sin_addr.s_addr = platform::INADDR_ANY;
   m_localAddress = m_requestedAddress;
-  m_socket = N_Socket::chkErr(
-      WSASocketA(FROM_PROTOCOL_INFO, FROM_PROTOCOL_INFO, FROM_PROTOCOL_INFO, provider, 0, WSA_FLAG_OVERLAPPED));
-  setIntOption(m_socket, SO_RCVBUF, kBufferSize);
-  setIntOption(m_socket, SO_SNDBUF, kBufferSize);
-  setIntOption(m_socket, SO_REUSEADDR, 1);
+  m_socket =
+      N_Socket::chkErr(platform::WSASocketA(platform::FROM_PROTOCOL_INFO, platform::FROM_PROTOCOL_INFO,
+                                            platform::FROM_PROTOCOL_INFO, provider, 0, platform::WSA_FLAG_OVERLAPPED));
+  setIntOption(m_socket, platform::SO_RCVBUF, kBufferSize);
+  setIntOption(m_socket, platform::SO_SNDBUF, kBufferSize);
+  setIntOption(m_socket, platform::SO_REUSEADDR, 1);
   // Selected before bind and listen; the network thread only waits on the
   // event once the registry below has it.
-  N_Socket::chkErr(WSAEventSelect(m_socket, m_event, FD_ACCEPT));
-  N_Socket::chkErr(bind(m_socket, reinterpret_cast<const sockaddr*>(&m_localAddress), sizeof m_localAddress));
+  N_Socket::chkErr(platform::WSAEventSelect(m_socket, m_event, platform::FD_ACCEPT));
+  N_Socket::chkErr(
+      platform::bind(m_socket, reinterpret_cast<const platform::sockaddr*>(&m_localAddress), sizeof m_localAddress));
   const unsigned backlog = N_Initializer::getLimits().uListenBacklog;
-  N_Socket::chkErr(listen(m_socket, backlog != 0 ? static_cast<int>(backlog) : SOMAXCONN));
+  N_Socket::chkErr(platform::listen(m_socket, backlog != 0 ? static_cast<int>(backlog) : platform::SOMAXCONN));
   int length = sizeof m_localAddress;
-  N_Socket::chkErr(getsockname(m_socket, reinterpret_cast<sockaddr*>(&m_localAddress), &length));
+  N_Socket::chkErr(platform::getsockname(m_socket, reinterpret_cast<platform::sockaddr*>(&m_localAddress), &length));
   try {
     N_Listener** slot = N_Initializer::m_pListeners->append();
     *slot = this;
     m_pRegistryEntry = slot;
   } catch (...) {
     // Nothing of the attempt stays: the object is left unconstructed.
-    N_Socket::chkErr(closesocket(m_socket));
-    WSACloseEvent(m_event);
+    N_Socket::chkErr(platform::closesocket(m_socket));
+    platform::WSACloseEvent(m_event);
     initializeMembers();
     throw;
   }
@@ -83,8 +84,8 @@ void N_Listener::destruct() {
   if (!m_bConstructed) return;
   RuntimeLock lock;
   N_Initializer::releaseThreadLoop();
-  N_Socket::chkErr(closesocket(m_socket));
-  WSACloseEvent(m_event);
+  N_Socket::chkErr(platform::closesocket(m_socket));
+  platform::WSACloseEvent(m_event);
   if (m_pRegistryEntry != nullptr && N_Initializer::m_pListeners != nullptr)
     N_Initializer::m_pListeners->remove(m_pRegistryEntry);
   N_Initializer::releaseThreadLoop();
@@ -112,7 +113,8 @@ bool N_Listener::rejectConnect(N_Socket::ConnectData* data) {
   for (N_Socket::ConnectData* entry = queue != nullptr ? queue->getFirst() : nullptr; entry != nullptr;
        entry = queue->getNext(entry)) {
     if (entry != data || entry->pListener != this) continue;
-    if (entry->socket != INVALID_SOCKET && entry->socket != 0) N_Socket::chkErr(closesocket(entry->socket));
+    if (entry->socket != platform::INVALID_SOCKET && entry->socket != 0)
+      N_Socket::chkErr(platform::closesocket(entry->socket));
     queue->remove(entry);
     // The listener may have stopped accepting at a full queue.
     N_Initializer::releaseThreadLoop();

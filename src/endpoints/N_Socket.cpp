@@ -14,16 +14,14 @@
 #include "win32.h"
 #include "winsock.h"
 
-using namespace platform;
-
 namespace {
 
 // FD_READ | FD_WRITE | FD_CONNECT | FD_CLOSE
 constexpr long kSocketEvents = 51;
 constexpr int kBufferSize = 65536;
 
-void setIntOption(SOCKET s, int option, int value) {
-  setsockopt(s, SOL_SOCKET, option, reinterpret_cast<const char*>(&value), sizeof value);
+void setIntOption(platform::SOCKET s, int option, int value) {
+  platform::setsockopt(s, platform::SOL_SOCKET, option, reinterpret_cast<const char*>(&value), sizeof value);
 }
 
 }  // namespace
@@ -91,7 +89,7 @@ void N_Socket::baseConstructor() {
   m_bPackage = true;
   std::memset(&m_remoteAddress, 0, sizeof m_remoteAddress);
   std::memset(&m_localAddress, 0, sizeof m_localAddress);
-  m_event = WSACreateEvent();
+  m_event = platform::WSACreateEvent();
 }
 
 void N_Socket::construct(ConnectData* data) {
@@ -102,19 +100,20 @@ void N_Socket::construct(ConnectData* data) {
     m_remoteAddress = data->address;
     m_bConnected = true;
     m_socket = data->socket;
-    setIntOption(m_socket, SO_RCVBUF, kBufferSize);
-    setIntOption(m_socket, SO_SNDBUF, kBufferSize);
+    setIntOption(m_socket, platform::SO_RCVBUF, kBufferSize);
+    setIntOption(m_socket, platform::SO_SNDBUF, kBufferSize);
     int limit = 0;
     int length = sizeof limit;
-    if (getsockopt(m_socket, SOL_SOCKET, SO_SNDBUF, reinterpret_cast<char*>(&limit), &length) == 0)
+    if (platform::getsockopt(m_socket, platform::SOL_SOCKET, platform::SO_SNDBUF, reinterpret_cast<char*>(&limit),
+                             &length) == 0)
       m_iMaximumSendPacketSize = limit;
     m_pAddress = Q_New<N_Address>(inet_ntoa(m_remoteAddress.sin_addr));
     m_bOwnsAddress = true;
-    m_iPort = ntohs(m_remoteAddress.sin_port);
+    m_iPort = platform::ntohs(m_remoteAddress.sin_port);
     m_socketType = SOCKET_TCP;
-    chkErr(WSAEventSelect(m_socket, m_event, kSocketEvents));
+    chkErr(platform::WSAEventSelect(m_socket, m_event, kSocketEvents));
     length = sizeof m_localAddress;
-    chkErr(getsockname(m_socket, reinterpret_cast<sockaddr*>(&m_localAddress), &length));
+    chkErr(platform::getsockname(m_socket, reinterpret_cast<platform::sockaddr*>(&m_localAddress), &length));
     // Register before the entry goes, so that a failed registration leaves
     // the entry queued (its socket closed by the clean-up below).
     N_Socket** slot = N_Initializer::m_pSockets->append();
@@ -138,42 +137,45 @@ void N_Socket::construct(const N_Address* address, int port, SocketType type) {
     m_pAddress = address;
     m_iPort = port;
     m_socketType = type;
-    WSAPROTOCOL_INFOA* provider = N_Initializer::m_tcpProtocol;
+    platform::WSAPROTOCOL_INFOA* provider = N_Initializer::m_tcpProtocol;
     if (type == SOCKET_UDP) {
       provider = N_Initializer::m_udpProtocol;
       m_bConnected = true;
       m_bPackage = false;
     }
-    std::uint16_t family = static_cast<std::uint16_t>(provider != nullptr ? provider->iAddressFamily : AF_INET);
+    std::uint16_t family =
+        static_cast<std::uint16_t>(provider != nullptr ? provider->iAddressFamily : platform::AF_INET);
     m_remoteAddress.sin_family = family;
-    m_remoteAddress.sin_port = htons(static_cast<std::uint16_t>(port));
+    m_remoteAddress.sin_port = platform::htons(static_cast<std::uint16_t>(port));
     unsigned int identifier = address != nullptr ? address->getIdentifier() : 0;
     if (identifier == 0) Q_Throw<N_NetException_IPNotResolved>();
     m_remoteAddress.sin_addr.s_addr = identifier;
     m_localAddress.sin_family = family;
-    m_localAddress.sin_port = type == SOCKET_UDP ? htons(static_cast<std::uint16_t>(port)) : 0;
+    m_localAddress.sin_port = type == SOCKET_UDP ? platform::htons(static_cast<std::uint16_t>(port)) : 0;
     const N_Address* local = N_Address::getLocalAddress();
     m_localAddress.sin_addr.s_addr = local != nullptr ? local->getIdentifier() : 0;
-    m_socket = chkErr(WSASocketA(FROM_PROTOCOL_INFO, FROM_PROTOCOL_INFO, FROM_PROTOCOL_INFO, provider, 0,
-                                 WSA_FLAG_OVERLAPPED));
-    chkErr(WSAEventSelect(m_socket, m_event, kSocketEvents));
-    setIntOption(m_socket, SO_RCVBUF, kBufferSize);
-    setIntOption(m_socket, SO_SNDBUF, kBufferSize);
-    setIntOption(m_socket, SO_REUSEADDR, 1);
+    m_socket = chkErr(platform::WSASocketA(platform::FROM_PROTOCOL_INFO, platform::FROM_PROTOCOL_INFO,
+                                           platform::FROM_PROTOCOL_INFO, provider, 0, platform::WSA_FLAG_OVERLAPPED));
+    chkErr(platform::WSAEventSelect(m_socket, m_event, kSocketEvents));
+    setIntOption(m_socket, platform::SO_RCVBUF, kBufferSize);
+    setIntOption(m_socket, platform::SO_SNDBUF, kBufferSize);
+    setIntOption(m_socket, platform::SO_REUSEADDR, 1);
     int limit = 0;
     int length = sizeof limit;
-    if (getsockopt(m_socket, SOL_SOCKET, type == SOCKET_UDP ? SO_MAX_MSG_SIZE : SO_SNDBUF,
-                   reinterpret_cast<char*>(&limit), &length) == 0)
+    if (platform::getsockopt(m_socket, platform::SOL_SOCKET,
+                             type == SOCKET_UDP ? platform::SO_MAX_MSG_SIZE : platform::SO_SNDBUF,
+                             reinterpret_cast<char*>(&limit), &length) == 0)
       m_iMaximumSendPacketSize = limit;
-    if (bind(m_socket, reinterpret_cast<const sockaddr*>(&m_localAddress), sizeof m_localAddress) == SOCKET_ERROR &&
-        WSAGetLastError() == WSAEADDRINUSE)
+    if (platform::bind(m_socket, reinterpret_cast<const platform::sockaddr*>(&m_localAddress), sizeof m_localAddress) ==
+            platform::SOCKET_ERROR &&
+        platform::WSAGetLastError() == platform::WSAEADDRINUSE)
       Q_Throw<N_NetException_LocalAddressAlreadyInUse>();
-    if (WSAConnect(m_socket, reinterpret_cast<const sockaddr*>(&m_remoteAddress), sizeof m_remoteAddress, nullptr,
-                   nullptr, nullptr, nullptr) == SOCKET_ERROR &&
-        WSAGetLastError() == WSAEADDRINUSE)
+    if (platform::WSAConnect(m_socket, reinterpret_cast<const platform::sockaddr*>(&m_remoteAddress),
+                             sizeof m_remoteAddress, nullptr, nullptr, nullptr, nullptr) == platform::SOCKET_ERROR &&
+        platform::WSAGetLastError() == platform::WSAEADDRINUSE)
       Q_Throw<N_NetException_LocalAddressAlreadyInUse>();
     length = sizeof m_localAddress;
-    chkErr(getsockname(m_socket, reinterpret_cast<sockaddr*>(&m_localAddress), &length));
+    chkErr(platform::getsockname(m_socket, reinterpret_cast<platform::sockaddr*>(&m_localAddress), &length));
     N_Socket** slot = N_Initializer::m_pSockets->append();
     *slot = this;
     m_pRegistryEntry = slot;
@@ -190,9 +192,9 @@ void N_Socket::destruct() {
   RuntimeLock lock;
   N_Initializer::releaseThreadLoop();
   awaitDelivery();
-  chkErr(WSAEventSelect(m_socket, m_event, 0));
-  WSACloseEvent(m_event);
-  if (m_socket != 0) chkErr(closesocket(m_socket));
+  chkErr(platform::WSAEventSelect(m_socket, m_event, 0));
+  platform::WSACloseEvent(m_event);
+  if (m_socket != 0) chkErr(platform::closesocket(m_socket));
   // Entries in flight become orphans: Winsock may still name their
   // overlapped, so only the network side may free them.
   for (auto* queue : {N_Initializer::m_pInProcessQueue, N_Initializer::m_pOutProcessQueue}) {
@@ -225,7 +227,7 @@ void N_Socket::destruct() {
 void N_Socket::disconnect() {
   // One event, whichever of the application and FD_CLOSE comes first.
   if (!m_bConnected.exchange(false)) return;
-  WSASendDisconnect(m_socket, nullptr);
+  platform::WSASendDisconnect(m_socket, nullptr);
   bool keep = true;
   try {
     keep = receiveDisconnect();
@@ -360,9 +362,9 @@ bool N_Socket::receive(void*, unsigned int) { return true; }
 
 int N_Socket::chkErr(int result) { return result; }
 
-SOCKET N_Socket::chkErr(SOCKET result) { return result; }
+platform::SOCKET N_Socket::chkErr(platform::SOCKET result) { return result; }
 
 const char* N_Socket::getWSErrorName(int code) {
-  const char* name = wsaErrorName(code);
+  const char* name = platform::wsaErrorName(code);
   return name != nullptr ? name : "Undetermined error";
 }

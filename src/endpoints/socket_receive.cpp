@@ -26,8 +26,6 @@
 #include "win32.h"
 #include "winsock.h"
 
-using namespace platform;
-
 namespace {
 
 constexpr unsigned int kReadSize = 65536;
@@ -62,13 +60,13 @@ void N_Socket::postRead() {
     return;
   }
   entry->overlapped.hEvent = entry;
-  DWORD received = 0;
-  DWORD flags = 0;
+  platform::DWORD received = 0;
+  platform::DWORD flags = 0;
   if (WSARecv(m_socket, &entry->wsaBuf, 1, &received, &flags, &entry->overlapped, N_Initializer::receiveComplete) ==
-      SOCKET_ERROR) {
-    int error = WSAGetLastError();
+      platform::SOCKET_ERROR) {
+    int error = platform::WSAGetLastError();
     // WSAEWOULDBLOCK counts as under way, like WSA_IO_PENDING.
-    if (error != WSAEWOULDBLOCK && error != WSA_IO_PENDING) {
+    if (error != platform::WSAEWOULDBLOCK && error != platform::WSA_IO_PENDING) {
       Q_DeleteArray(entry->pBuffer);
       entry->pBuffer = nullptr;
       entry->wsaBuf.buf = nullptr;
@@ -133,7 +131,7 @@ void N_Socket::awaitDelivery() {
   while (m_pDelivering != nullptr && !tl_bInReceive) {
     {
       RuntimeUnlock stepOut;
-      Sleep(1);
+      platform::Sleep(1);
     }
     // The network thread may have gone back to its wait meanwhile, on this
     // socket's event too: it must leave it before the event is closed.
@@ -283,7 +281,8 @@ bool N_Socket::receivePackaged(DataQueue* read, unsigned int bytes, const ReadLi
   return true;
 }
 
-void N_Initializer::receiveComplete(DWORD error, DWORD bytes, OVERLAPPED* overlapped, DWORD flags) {
+void N_Initializer::receiveComplete(platform::DWORD error, platform::DWORD bytes, platform::OVERLAPPED* overlapped,
+                                    platform::DWORD flags) {
   auto* read = static_cast<N_Socket::DataQueue*>(overlapped->hEvent);
   if (error != 0) {
     const char* text = Q_STR(
@@ -321,7 +320,7 @@ void N_Initializer::receiveComplete(DWORD error, DWORD bytes, OVERLAPPED* overla
   m_pInProcessQueue->remove(read);
 }
 
-void N_Socket::injectRead(N_Socket* socket, const void* bytes, unsigned int size, DWORD error) {
+void N_Socket::injectRead(N_Socket* socket, const void* bytes, unsigned int size, platform::DWORD error) {
   size = std::min(size, kReadSize);
   RuntimeLock lock;
   Q_DLList<DataQueue>* queue = N_Initializer::m_pInProcessQueue;

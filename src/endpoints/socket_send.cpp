@@ -17,8 +17,6 @@
 #include "win32.h"
 #include "winsock.h"
 
-using namespace platform;
-
 namespace {
 
 // A chunk keeps 16 bytes below the send limit, also the first one that
@@ -105,7 +103,8 @@ void N_Socket::send(void* data, unsigned int size) {
   N_Initializer::releaseThreadLoop();
 }
 
-void N_Socket::sendComplete(DWORD dwError, DWORD cbTransferred, OVERLAPPED* lpOverlapped, DWORD dwFlags) {
+void N_Socket::sendComplete(platform::DWORD dwError, platform::DWORD cbTransferred, platform::OVERLAPPED* lpOverlapped,
+                            platform::DWORD dwFlags) {
   DataQueue* entry = static_cast<DataQueue*>(lpOverlapped->hEvent);
   if (dwError != 0) {
     const char* text = Q_STR(

@@ -11,20 +11,20 @@
 #include "win32.h"
 #include "winsock.h"
 
-using namespace platform;
-
 namespace {
 
 const char kNetworkMutexName[] = "Kelvane network mutex";
-constexpr WORD kWinsockVersion = 0x0002;  // 2.0
-constexpr DWORD kMaximumWaitEvents = 64;
+constexpr platform::WORD kWinsockVersion = 0x0002;  // 2.0
+constexpr platform::DWORD kMaximumWaitEvents = 64;
 // How long the start waits for the local host's identifier.
 constexpr float kLocalAddressSeconds = 10.0f;
 
-constexpr DWORD kTcpFlags =
-    XP1_GUARANTEED_DELIVERY | XP1_GUARANTEED_ORDER | XP1_GRACEFUL_CLOSE | XP1_EXPEDITED_DATA | XP1_IFS_HANDLES;
-constexpr DWORD kUdpFlags =
-    XP1_CONNECTIONLESS | XP1_MESSAGE_ORIENTED | XP1_SUPPORT_BROADCAST | XP1_SUPPORT_MULTIPOINT | XP1_IFS_HANDLES;
+constexpr platform::DWORD kTcpFlags = platform::XP1_GUARANTEED_DELIVERY | platform::XP1_GUARANTEED_ORDER |
+                                      platform::XP1_GRACEFUL_CLOSE | platform::XP1_EXPEDITED_DATA |
+                                      platform::XP1_IFS_HANDLES;
+constexpr platform::DWORD kUdpFlags = platform::XP1_CONNECTIONLESS | platform::XP1_MESSAGE_ORIENTED |
+                                      platform::XP1_SUPPORT_BROADCAST | platform::XP1_SUPPORT_MULTIPOINT |
+                                      platform::XP1_IFS_HANDLES;
 
 // Deletes every object a registry still names, oldest first, then whatever
 // entries are left, then the list. Each object's destructor takes its own
@@ -61,14 +61,14 @@ void deleteQueue(Q_DLList<N_Socket::DataQueue>*& queue) {
 std::uint32_t N_Initializer::m_uInstance = 0;
 N_Initializer* N_Initializer::m_pActiveObject = nullptr;
 std::atomic<N_Initializer::ThreadState> N_Initializer::m_threadState{THREAD_STOPPED};
-CWinThread* N_Initializer::m_pThread = nullptr;
+platform::CWinThread* N_Initializer::m_pThread = nullptr;
 bool N_Initializer::m_bThreadStartFailed = false;
 int N_Initializer::m_iNumProtocols = 0;
-WSAPROTOCOL_INFOA* N_Initializer::m_installedProtocols = nullptr;
-WSAPROTOCOL_INFOA* N_Initializer::m_tcpProtocol = nullptr;
-WSAPROTOCOL_INFOA* N_Initializer::m_udpProtocol = nullptr;
-HANDLE N_Initializer::m_hMutex = nullptr;
-WSAEVENT N_Initializer::m_eventRelease = nullptr;
+platform::WSAPROTOCOL_INFOA* N_Initializer::m_installedProtocols = nullptr;
+platform::WSAPROTOCOL_INFOA* N_Initializer::m_tcpProtocol = nullptr;
+platform::WSAPROTOCOL_INFOA* N_Initializer::m_udpProtocol = nullptr;
+platform::HANDLE N_Initializer::m_hMutex = nullptr;
+platform::WSAEVENT N_Initializer::m_eventRelease = nullptr;
 N_Address* N_Initializer::m_pLocalAddress = nullptr;
 Q_DLList<N_Socket*>* N_Initializer::m_pSockets = nullptr;
 Q_DLList<N_Listener*>* N_Initializer::m_pListeners = nullptr;
@@ -113,15 +113,15 @@ void N_Initializer::start() {
   m_uBytesWaitingForSend = 0;
   m_bReadsToResume = false;
 
-  m_hMutex = CreateMutexA(nullptr, FALSE, kNetworkMutexName);
+  m_hMutex = platform::CreateMutexA(nullptr, platform::FALSE, kNetworkMutexName);
 
   int started = WSAStartup(kWinsockVersion, &m_wsaData);
   switch (started) {
-    case WSASYSNOTREADY:
+    case platform::WSASYSNOTREADY:
       Q_Throw<N_NetException_Unavailable>();
-    case WSAVERNOTSUPPORTED:
+    case platform::WSAVERNOTSUPPORTED:
       Q_Throw<N_NetException_NotSupported>();
-    case WSAEPROCLIM:
+    case platform::WSAEPROCLIM:
       Q_Throw<N_NetException_ProcessLimit>();
     default:
       break;
@@ -129,35 +129,35 @@ void N_Initializer::start() {
   // 2.0 exactly: a newer Winsock answers a request for 2.0 with 2.0. After
   // any other failed start m_wsaData is still zero and fails this test too,
   // but there is nothing to clean up then.
-  BYTE major = static_cast<BYTE>(m_wsaData.wVersion & 0xFF);
-  BYTE minor = static_cast<BYTE>(m_wsaData.wVersion >> 8);
+  platform::BYTE major = static_cast<platform::BYTE>(m_wsaData.wVersion & 0xFF);
+  platform::BYTE minor = static_cast<platform::BYTE>(m_wsaData.wVersion >> 8);
   if (major != 2 || minor != 0) {
-    if (started == 0) WSACleanup();
+    if (started == 0) platform::WSACleanup();
     Q_Throw<N_NetException_VersionFailure>();
   }
 
   // The first call only tells the size of the catalogue.
-  DWORD bytes = 0;
-  m_iNumProtocols = WSAEnumProtocolsA(nullptr, nullptr, &bytes);
-  m_installedProtocols = reinterpret_cast<WSAPROTOCOL_INFOA*>(Q_NewArray<char>(bytes));
+  platform::DWORD bytes = 0;
+  m_iNumProtocols = platform::WSAEnumProtocolsA(nullptr, nullptr, &bytes);
+  m_installedProtocols = reinterpret_cast<platform::WSAPROTOCOL_INFOA*>(Q_NewArray<char>(bytes));
   m_iNumProtocols = WSAEnumProtocolsA(nullptr, m_installedProtocols, &bytes);
   // Never trust a count beyond the buffer it describes.
-  int fits = static_cast<int>(bytes / sizeof(WSAPROTOCOL_INFOA));
+  int fits = static_cast<int>(bytes / sizeof(platform::WSAPROTOCOL_INFOA));
   if (m_iNumProtocols > fits) m_iNumProtocols = fits;
 
   chooseProviders();
   if (m_tcpProtocol == nullptr) Q_Throw<N_NetException_NoTCP>();
   if (m_udpProtocol == nullptr) Q_Throw<N_NetException_NoUDP>();
 
-  m_eventRelease = WSACreateEvent();
+  m_eventRelease = platform::WSACreateEvent();
 
   // The thread writes THREAD_RUNNING once, without looking; waiting for that
   // write here means no stop can be overwritten by it.
-  m_pThread = AfxBeginThread(threadNetwork, this, 0, 0, 0, nullptr);
+  m_pThread = platform::AfxBeginThread(threadNetwork, this, 0, 0, 0, nullptr);
   if (m_pThread == nullptr) {
     m_bThreadStartFailed = true;
   } else {
-    while (m_threadState.load() != THREAD_RUNNING) Sleep(1);
+    while (m_threadState.load() != THREAD_RUNNING) platform::Sleep(1);
   }
 
   makeLocalAddress();
@@ -169,8 +169,8 @@ void N_Initializer::chooseProviders() {
   m_udpProtocol = nullptr;
   m_tcpProtocol = nullptr;
   for (int i = 0; i < m_iNumProtocols; ++i) {
-    WSAPROTOCOL_INFOA* entry = &m_installedProtocols[i];
-    if (entry->iAddressFamily != AF_INET) continue;
+    platform::WSAPROTOCOL_INFOA* entry = &m_installedProtocols[i];
+    if (entry->iAddressFamily != platform::AF_INET) continue;
     if (m_tcpProtocol == nullptr && (entry->dwServiceFlags1 & kTcpFlags) == kTcpFlags) m_tcpProtocol = entry;
     if (m_udpProtocol == nullptr && (entry->dwServiceFlags1 & kUdpFlags) == kUdpFlags) m_udpProtocol = entry;
   }
@@ -179,8 +179,6 @@ void N_Initializer::chooseProviders() {
 // Waits, bounded, for the local host's identifier. A lookup that has ended
 // without one won't bring it later, so the wait ends with it.
 void N_Initializer::makeLocalAddress() {
-  // Qualified: the C library's gethostname may be visible through standard
-  // headers, and would win for a size_t length.
   char name[1024] = {};
   platform::gethostname(name, static_cast<int>(sizeof name));
   m_pLocalAddress = Q_New<N_Address>(name);
@@ -188,19 +186,19 @@ void N_Initializer::makeLocalAddress() {
   Q_Timer timer;
   while (m_pLocalAddress->getIdentifier() == 0 && m_pLocalAddress->lookupPending() &&
          timer.getAge() < kLocalAddressSeconds) {
-    Sleep(10);
+    platform::Sleep(10);
   }
   if (m_pLocalAddress->getIdentifier() == 0) Q_Throw<N_NetException_IPNotResolved>();
 }
 
 void N_Initializer::stop() {
   // Frees the network thread if this thread still owns the mutex by a level.
-  ReleaseMutex(m_hMutex);
+  platform::ReleaseMutex(m_hMutex);
 
   if (!m_bThreadStartFailed) {
     m_threadState.store(THREAD_STOPPING);
     releaseThreadLoop();
-    while (m_threadState.load() != THREAD_STOPPED) Sleep(10);
+    while (m_threadState.load() != THREAD_STOPPED) platform::Sleep(10);
     // The thread writes THREAD_STOPPED just before its last release of the
     // mutex; taking it once makes sure that release is done before anything
     // below closes the mutex.
@@ -229,17 +227,18 @@ void N_Initializer::stop() {
   m_pPumpFrom = nullptr;
   m_uBytesWaitingForSend = 0;
 
-  WSACloseEvent(m_eventRelease);
-  CloseHandle(m_hMutex);
+  platform::WSACloseEvent(m_eventRelease);
+  platform::CloseHandle(m_hMutex);
   m_hMutex = nullptr;
-  WSACleanup();
+  platform::WSACleanup();
 }
 
-void N_Initializer::releaseThreadLoop() { WSASetEvent(m_eventRelease); }
+void N_Initializer::releaseThreadLoop() { platform::WSASetEvent(m_eventRelease); }
 
-int N_Initializer::acceptConnection(WSABUF*, WSABUF*, _QualityOfService*, _QualityOfService*, WSABUF*, WSABUF*,
-                                    UINT*, std::uintptr_t) {
-  return CF_ACCEPT;
+int N_Initializer::acceptConnection(platform::WSABUF*, platform::WSABUF*, platform::_QualityOfService*,
+                                    platform::_QualityOfService*, platform::WSABUF*, platform::WSABUF*, platform::UINT*,
+                                    std::uintptr_t) {
+  return platform::CF_ACCEPT;
 }
 
 unsigned int N_Initializer::threadNetwork(void*) {
@@ -248,11 +247,11 @@ unsigned int N_Initializer::threadNetwork(void*) {
   MutexHold hold(m_hMutex);
   m_threadState.store(THREAD_RUNNING);
 
-  WSAEVENT events[kMaximumWaitEvents];
+  platform::WSAEVENT events[kMaximumWaitEvents];
   int failedWaits = 0;
   while (m_threadState.load() == THREAD_RUNNING) {
-    DWORD count = 1;
-    DWORD timeout = WSA_INFINITE;
+    platform::DWORD count = 1;
+    platform::DWORD timeout = platform::WSA_INFINITE;
     events[0] = m_eventRelease;
     try {
       count = buildWaitSet(events, timeout);
@@ -265,22 +264,24 @@ unsigned int N_Initializer::threadNetwork(void*) {
     hold.unlock();
 
     // Completion routines run inside this wait and take the mutex themselves.
-    DWORD result = WSAWaitForMultipleEvents(count, events, FALSE, timeout, TRUE);
+    platform::DWORD result =
+        platform::WSAWaitForMultipleEvents(count, events, platform::FALSE, timeout, platform::TRUE);
     if (m_threadState.load() != THREAD_RUNNING) break;
 
     // A wait that keeps failing (a broken release event, say) must not turn
     // into a busy loop; a single failure, from a handle closed just before
     // the wait, costs nothing.
-    if (result == WSA_WAIT_FAILED) {
-      if (++failedWaits > 1) Sleep(10);
+    if (result == platform::WSA_WAIT_FAILED) {
+      if (++failedWaits > 1) platform::Sleep(10);
     } else {
       failedWaits = 0;
     }
 
     hold.lock();
-    if (result == WSA_WAIT_EVENT_0) {
-      WSAResetEvent(events[0]);
-    } else if (result == WSA_WAIT_FAILED || result == WSA_WAIT_IO_COMPLETION || result == WSA_WAIT_TIMEOUT) {
+    if (result == platform::WSA_WAIT_EVENT_0) {
+      platform::WSAResetEvent(events[0]);
+    } else if (result == platform::WSA_WAIT_FAILED || result == platform::WSA_WAIT_IO_COMPLETION ||
+               result == platform::WSA_WAIT_TIMEOUT) {
       // Nothing to serve; the next pass builds the wait set anew.
     } else if (result < count) {
       try {

@@ -12,23 +12,21 @@
 #include "win32.h"
 #include "winsock.h"
 
-using namespace platform;
-
-DWORD N_Initializer::buildWaitSet(WSAEVENT* events, DWORD& timeout) {
+platform::DWORD N_Initializer::buildWaitSet(platform::WSAEVENT* events, platform::DWORD& timeout) {
   const N_Limits limits = getLimits();
   const bool listenersFirst = limits.bListenersFirst;
-  DWORD count = 0;
-  timeout = WSA_INFINITE;
+  platform::DWORD count = 0;
+  timeout = platform::WSA_INFINITE;
   events[count++] = m_eventRelease;
   auto addListeners = [&] {
-    for (N_Listener** slot = m_pListeners->getFirst(); slot != nullptr && count < WSA_MAXIMUM_WAIT_EVENTS;
+    for (N_Listener** slot = m_pListeners->getFirst(); slot != nullptr && count < platform::WSA_MAXIMUM_WAIT_EVENTS;
          slot = m_pListeners->getNext(slot)) {
       N_Listener* listener = *slot;
       if (listener == nullptr) continue;
       // Resting after a failed accept: the wait ends when the rest does.
       float rest = listener->m_fRestSeconds - listener->m_restTimer.getAge();
       if (rest > 0.0f) {
-        DWORD milliseconds = static_cast<DWORD>(rest * 1000.0f) + 1;
+        platform::DWORD milliseconds = static_cast<platform::DWORD>(rest * 1000.0f) + 1;
         if (milliseconds < timeout) timeout = milliseconds;
         continue;
       }
@@ -42,7 +40,7 @@ DWORD N_Initializer::buildWaitSet(WSAEVENT* events, DWORD& timeout) {
   // waited on. The lists keep their order, so the same objects stay out
   // until others go.
   if (listenersFirst) addListeners();
-  for (N_Socket** slot = m_pSockets->getFirst(); slot != nullptr && count < WSA_MAXIMUM_WAIT_EVENTS;
+  for (N_Socket** slot = m_pSockets->getFirst(); slot != nullptr && count < platform::WSA_MAXIMUM_WAIT_EVENTS;
        slot = m_pSockets->getNext(slot))
     if (*slot != nullptr) events[count++] = (*slot)->m_event;
   if (!listenersFirst) addListeners();
@@ -95,16 +93,16 @@ void N_Initializer::pumpSends() {
       }
     } else if (!entry->bIssued && socket->m_bWritable && socket->m_uPumpHeldPass != pass) {
       entry->overlapped.hEvent = entry;
-      DWORD sent = 0;
+      platform::DWORD sent = 0;
       if (WSASend(socket->m_socket, &entry->wsaBuf, 1, &sent, 0, &entry->overlapped, N_Socket::sendComplete) == 0) {
         entry->bIssued = true;
       } else {
-        int error = WSAGetLastError();
-        if (error == WSAEWOULDBLOCK) {
+        int error = platform::WSAGetLastError();
+        if (error == platform::WSAEWOULDBLOCK) {
           // This and every later entry of the socket wait for FD_WRITE.
           socket->m_bWritable = false;
           entry->overlapped.hEvent = nullptr;
-        } else if (error == WSA_IO_PENDING) {
+        } else if (error == platform::WSA_IO_PENDING) {
           // Later entries wait for this one's completion.
           entry->bIssued = true;
           socket->m_bWritable = false;
@@ -123,7 +121,7 @@ void N_Initializer::pumpSends() {
   m_pPumpFrom = firstUnsettled;
 }
 
-void N_Initializer::serveEvent(WSAEVENT handle) {
+void N_Initializer::serveEvent(platform::WSAEVENT handle) {
   // Found by handle, not by slot: the lists may have changed in the wait.
   N_Socket* socket = nullptr;
   for (N_Socket** slot = m_pSockets->getFirst(); slot != nullptr; slot = m_pSockets->getNext(slot)) {
@@ -142,11 +140,11 @@ void N_Initializer::serveEvent(WSAEVENT handle) {
 
   if (socket != nullptr) {
     // Zeroed first: a failed enumeration must not serve an old record again.
-    WSANETWORKEVENTS events;
+    platform::WSANETWORKEVENTS events;
     std::memset(&events, 0, sizeof events);
-    N_Socket::chkErr(WSAEnumNetworkEvents(socket->m_socket, socket->m_event, &events));
+    N_Socket::chkErr(platform::WSAEnumNetworkEvents(socket->m_socket, socket->m_event, &events));
     long what = events.lNetworkEvents;
-    if ((what & FD_CONNECT) && events.iErrorCode[FD_CONNECT_BIT] == 0 && !socket->m_bConnected) {
+    if ((what & platform::FD_CONNECT) && events.iErrorCode[platform::FD_CONNECT_BIT] == 0 && !socket->m_bConnected) {
       socket->m_bConnected = true;
       bool keep = true;
       try {
@@ -156,7 +154,7 @@ void N_Initializer::serveEvent(WSAEVENT handle) {
       }
       if (keep) socket->m_bEventPending = true;
     }
-    if (what & FD_READ) {
+    if (what & platform::FD_READ) {
       // A socket whose unpolled messages passed the bound stops reading, so
       // that the peer's TCP waits; poll() lets it go on.
       unsigned backlog = getLimits().uReceiveBacklog;
@@ -165,8 +163,8 @@ void N_Initializer::serveEvent(WSAEVENT handle) {
       else
         socket->postRead();
     }
-    if (what & FD_WRITE) socket->m_bWritable = true;
-    if (what & FD_CLOSE) {
+    if (what & platform::FD_WRITE) socket->m_bWritable = true;
+    if (what & platform::FD_CLOSE) {
       try {
         socket->disconnect();
       } catch (...) {
@@ -176,34 +174,35 @@ void N_Initializer::serveEvent(WSAEVENT handle) {
   }
 
   if (listener != nullptr) {
-    WSANETWORKEVENTS events;
+    platform::WSANETWORKEVENTS events;
     std::memset(&events, 0, sizeof events);
-    N_Socket::chkErr(WSAEnumNetworkEvents(listener->m_socket, listener->m_event, &events));
-    if (!(events.lNetworkEvents & FD_ACCEPT)) return;
-    WSASetLastError(0);
+    N_Socket::chkErr(platform::WSAEnumNetworkEvents(listener->m_socket, listener->m_event, &events));
+    if (!(events.lNetworkEvents & platform::FD_ACCEPT)) return;
+    platform::WSASetLastError(0);
     N_Socket::ConnectData* entry = nullptr;
     try {
       entry = m_pConnectQueue->append();
     } catch (Q_MemoryException*) {
       // No room to keep the connection: accept it and close it, so that it
       // is refused rather than left waiting.
-      sockaddr_in address;
+      platform::sockaddr_in address;
       int length = sizeof address;
-      SOCKET refused = WSAAccept(listener->m_socket, reinterpret_cast<sockaddr*>(&address), &length, nullptr, 0);
-      if (refused != INVALID_SOCKET) closesocket(refused);
+      platform::SOCKET refused =
+          WSAAccept(listener->m_socket, reinterpret_cast<platform::sockaddr*>(&address), &length, nullptr, 0);
+      if (refused != platform::INVALID_SOCKET) platform::closesocket(refused);
       return;
     }
     entry->pListener = listener;
     std::memset(&entry->address, 0, sizeof entry->address);
     int length = sizeof entry->address;
-    entry->socket = N_Socket::chkErr(
-        WSAAccept(listener->m_socket, reinterpret_cast<sockaddr*>(&entry->address), &length, nullptr, 0));
-    int error = WSAGetLastError();
-    if (error == WSAECONNREFUSED) {
+    entry->socket = N_Socket::chkErr(platform::WSAAccept(
+        listener->m_socket, reinterpret_cast<platform::sockaddr*>(&entry->address), &length, nullptr, 0));
+    int error = platform::WSAGetLastError();
+    if (error == platform::WSAECONNREFUSED) {
       m_pConnectQueue->remove(entry);
       return;
     }
-    if (entry->socket == INVALID_SOCKET && (error == WSAEMFILE || error == WSAENOBUFS)) {
+    if (entry->socket == platform::INVALID_SOCKET && (error == platform::WSAEMFILE || error == platform::WSAENOBUFS)) {
       // The connection stays in the system's backlog; retrying at once would
       // spin on it until a descriptor is free.
       listener->m_fRestSeconds = getLimits().fAcceptBackoff;
