@@ -11,6 +11,7 @@
 // A message that lies whole in a read and ends it is handed out in place, in
 // the read buffer; one with bytes behind it is copied out.
 #include <algorithm>
+#include <atomic>
 #include <cstdint>
 #include <cstring>
 
@@ -183,95 +184,122 @@ void N_Socket::reserveCollected(std::int64_t needed, std::int64_t total) {
   m_iPacketCapacity = capacity;
 }
 
+namespace {
+
+// The message a socket collects across reads, seen through its members:
+// `have` bytes of it in `block` so far, `missing` still to come. Nothing is
+// collected while `have` is 0; `missing` is -1 while the prefix itself is cut.
+struct Collection {
+  enum State { kNothing, kPrefix, kBody };
+
+  char*& block;
+  std::int64_t& capacity;
+  std::atomic<int>& have;
+  std::atomic<int>& missing;
+
+  State state() const { return have == 0 ? kNothing : missing < 0 ? kPrefix : kBody; }
+  // A fresh block of `size` bytes for a message of which `total` bytes are
+  // to come (-1: its prefix is cut).
+  void begin(std::int64_t size, std::int64_t total) {
+    Q_DeleteArray(block);
+    block = nullptr;
+    block = Q_NewArray<char>(static_cast<std::size_t>(size));
+    capacity = size;
+    missing = static_cast<int>(total);
+  }
+  // Takes `n` bytes at `from`; in the body they count against what is missing.
+  void take(const char* from, std::int64_t n) {
+    if (n > 0) std::memcpy(block + have, from, static_cast<std::size_t>(n));
+    have = static_cast<int>(have + n);
+    if (missing >= 0) missing = static_cast<int>(missing - n);
+  }
+  // The prefix is whole: a block of `size` bytes for the body, the prefix
+  // moved into it.
+  void startBody(std::int64_t size, std::uint32_t length) {
+    char* body = Q_NewArray<char>(static_cast<std::size_t>(size));
+    std::memcpy(body, block, 4);
+    Q_DeleteArray(block);
+    block = body;
+    capacity = size;
+    missing = static_cast<int>(length);
+  }
+  // The finished block was handed on; nothing is collected any more.
+  void release() {
+    block = nullptr;
+    capacity = 0;
+    missing = 0;
+    have = 0;
+  }
+};
+
+}  // namespace
+
 bool N_Socket::receivePackaged(DataQueue* read, unsigned int bytes, const ReadLimits& limits) {
   if (m_bStreamBroken) return true;
+  Collection collected{m_pPacketBuffer, m_iPacketCapacity, m_iPacketBytesHave, m_iPacketBytesMissing};
   // 64-bit arithmetic: a length near 2^31 must not wrap the comparisons.
   std::int64_t left = bytes;
   char* cursor = read->wsaBuf.buf;
+  auto take = [&](std::int64_t n) {
+    collected.take(cursor, n);
+    cursor += n;
+    left -= n;
+  };
   try {
     while (left > 0) {
-      std::int64_t have = m_iPacketBytesHave;
-      std::int64_t missing = m_iPacketBytesMissing;
-      if (have == 0) {
-        if (left < 4) {
-          // The prefix itself is cut.
-          Q_DeleteArray(m_pPacketBuffer);
-          m_pPacketBuffer = nullptr;
-          m_pPacketBuffer = Q_NewArray<char>(static_cast<std::size_t>(left + kPrefixSlack));
-          std::memcpy(m_pPacketBuffer, cursor, static_cast<std::size_t>(left));
-          m_iPacketBytesMissing = -1;
-          m_iPacketBytesHave = static_cast<int>(left);
-          return true;
+      switch (collected.state()) {
+        case Collection::kNothing: {
+          if (left < 4) {
+            // The prefix itself is cut.
+            collected.begin(left + kPrefixSlack, -1);
+            take(left);
+            return true;
+          }
+          const std::uint32_t length = little_endian::get32(cursor);
+          if (length > limits.uMaximumLength) {
+            breakStream();
+            return true;
+          }
+          const std::int64_t total = std::int64_t{length} + 4;
+          if (left < total) {
+            // The message spans reads: collect it at its final size, or with
+            // compact messages in a block that grows as the bytes come.
+            collected.begin(limits.bCompact ? std::min(total, std::max<std::int64_t>(left, kCompactBelow)) : total,
+                            total);
+            take(left);
+            return true;
+          }
+          char* payload = cursor + 4;
+          cursor += total;
+          left -= total;
+          if (!finishInRead(read, payload, length, left == 0, limits)) return false;
+          break;
         }
-        std::uint32_t length = little_endian::get32(cursor);
-        if (length > limits.uMaximumLength) {
-          breakStream();
-          return true;
+        case Collection::kPrefix: {
+          // Complete the prefix, then collect the body in a block of its size.
+          take(std::min<std::int64_t>(4 - collected.have, left));
+          if (collected.have < 4) return true;
+          const std::uint32_t length = little_endian::get32(collected.block);
+          if (length > limits.uMaximumLength) {
+            breakStream();
+            return true;
+          }
+          const std::int64_t total = std::int64_t{length} + 4;
+          collected.startBody(limits.bCompact ? std::min<std::int64_t>(total, kCompactBelow) : total, length);
+          [[fallthrough]];  // an empty body is finished already
         }
-        if (left - length - 4 < 0) {
-          // The message spans reads: collect it at its final size, or with
-          // compact messages in a block that grows as the bytes come.
-          const std::int64_t total = std::int64_t(length) + 4;
-          Q_DeleteArray(m_pPacketBuffer);
-          m_pPacketBuffer = nullptr;
-          m_iPacketCapacity = limits.bCompact ? std::min(total, std::max<std::int64_t>(left, kCompactBelow)) : total;
-          m_pPacketBuffer = Q_NewArray<char>(static_cast<std::size_t>(m_iPacketCapacity));
-          std::memcpy(m_pPacketBuffer, cursor, static_cast<std::size_t>(left));
-          m_iPacketBytesMissing = static_cast<int>(length + 4 - left);
-          m_iPacketBytesHave = static_cast<int>(left);
-          return true;
+        case Collection::kBody: {
+          const std::int64_t n = std::min<std::int64_t>(collected.missing, left);
+          reserveCollected(collected.have + n, collected.have + collected.missing);
+          take(n);
+          if (collected.missing > 0) return true;
+          DataQueue* message =
+              appendMessage(collected.block, collected.block + 4, static_cast<unsigned int>(collected.have - 4));
+          collected.release();
+          if (!deliver(read, message)) return false;
+          break;
         }
-        char* payload = cursor + 4;
-        left -= 4 + std::int64_t(length);
-        cursor = payload + length;
-        if (!finishInRead(read, payload, length, left == 0, limits)) return false;
-        continue;
       }
-      if (missing < 0) {
-        // Complete the prefix, then collect the body in a block of its size.
-        std::int64_t n = 4 - have;
-        if (left < n) {
-          std::memcpy(m_pPacketBuffer + have, cursor, static_cast<std::size_t>(left));
-          m_iPacketBytesHave = static_cast<int>(have + left);
-          return true;
-        }
-        std::memcpy(m_pPacketBuffer + have, cursor, static_cast<std::size_t>(n));
-        cursor += n;
-        left -= n;
-        std::uint32_t length = little_endian::get32(m_pPacketBuffer);
-        if (length > limits.uMaximumLength) {
-          breakStream();
-          return true;
-        }
-        const std::int64_t total = std::int64_t(length) + 4;
-        const std::int64_t capacity = limits.bCompact ? std::min<std::int64_t>(total, kCompactBelow) : total;
-        char* block = Q_NewArray<char>(static_cast<std::size_t>(capacity));
-        std::memcpy(block, m_pPacketBuffer, 4);
-        Q_DeleteArray(m_pPacketBuffer);
-        m_pPacketBuffer = block;
-        m_iPacketCapacity = capacity;
-        have = 4;
-        missing = length;
-        m_iPacketBytesHave = 4;
-        m_iPacketBytesMissing = static_cast<int>(length);
-      }
-      reserveCollected(have + std::min(missing, left), have + missing);
-      if (missing > left) {
-        if (left > 0) std::memcpy(m_pPacketBuffer + have, cursor, static_cast<std::size_t>(left));
-        m_iPacketBytesMissing = static_cast<int>(missing - left);
-        m_iPacketBytesHave = static_cast<int>(have + left);
-        return true;
-      }
-      if (missing > 0) std::memcpy(m_pPacketBuffer + have, cursor, static_cast<std::size_t>(missing));
-      have += missing;
-      cursor += missing;
-      left -= missing;
-      DataQueue* message = appendMessage(m_pPacketBuffer, m_pPacketBuffer + 4, static_cast<unsigned int>(have - 4));
-      m_pPacketBuffer = nullptr;
-      m_iPacketCapacity = 0;
-      m_iPacketBytesMissing = 0;
-      m_iPacketBytesHave = 0;
-      if (!deliver(read, message)) return false;
     }
   } catch (Q_MemoryException*) {
     // What can't be held can't be skipped either: the stream has lost its
