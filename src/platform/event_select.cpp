@@ -1,6 +1,7 @@
 // WSAEventSelect and WSAEnumNetworkEvents: turning poll readiness into
 // Winsock's network-event record, with its re-enabling rules.
 #include "internal.h"  // first: see the note there
+#include "syscalls.h"
 
 #include <poll.h>
 #include <sys/ioctl.h>
@@ -147,7 +148,7 @@ void refresh(SocketState& socket) {
   if (socket.closed || socket.fd < 0 || !socket.event) return;
   if (socket.type == wsa::sockStream && (socket.phase == Phase::Fresh || socket.phase == Phase::Failed)) return;
   pollfd p{socket.fd, static_cast<short>(POLLIN | POLLOUT | POLLRDHUP), 0};
-  if (::poll(&p, 1, 0) > 0) recordReadiness(socket, p.revents);
+  if (sys::poll(&p, 1, 0) > 0) recordReadiness(socket, p.revents);
 }
 
 }  // namespace detail

@@ -158,6 +158,10 @@ class Reactor {
   Reactor& operator=(const Reactor&) = delete;
 
   static const std::shared_ptr<Reactor>& current();
+  // Owner only. Whether the wake-up descriptor exists, making it if it
+  // doesn't yet; false (the Winsock error set) while the system refuses one,
+  // and then nothing may wait on the network on this thread.
+  bool ready();
 
   // Any thread. Queues a finished operation for the owner and wakes it.
   void post(const Completion& completion);
@@ -175,7 +179,7 @@ class Reactor {
   void watch(const std::shared_ptr<struct SocketState>& socket);
 
  private:
-  int wakeFd_ = -1;
+  std::atomic<int> wakeFd_{-1};
   std::mutex lock_;
   std::vector<Completion> queue_;
   std::atomic<bool> pending_{false};

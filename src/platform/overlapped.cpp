@@ -1,5 +1,6 @@
 // Overlapped WSASend and WSARecv with completion routines.
 #include "internal.h"  // first: see the note there
+#include "syscalls.h"
 
 #include <sys/socket.h>
 #include <sys/uio.h>
@@ -44,7 +45,7 @@ ssize_t sendGathered(int fd, iovec* iov, int count) {
   msghdr message{};
   message.msg_iov = iov;
   message.msg_iovlen = static_cast<std::size_t>(count);
-  return ::sendmsg(fd, &message, MSG_NOSIGNAL | MSG_DONTWAIT);
+  return sys::sendmsg(fd, &message, MSG_NOSIGNAL | MSG_DONTWAIT);
 }
 
 void failSends(SocketState& socket, int err) {
@@ -141,7 +142,7 @@ ssize_t readInto(SocketState& socket, Operation& op) {
   message.msg_iov = iov;
   message.msg_iovlen = static_cast<std::size_t>(n);
   for (int refusals = 0;;) {
-    ssize_t got = ::recvmsg(socket.fd, &message, MSG_DONTWAIT);
+    ssize_t got = sys::recvmsg(socket.fd, &message, MSG_DONTWAIT);
     if (got >= 0) return got;
     if (errno == EINTR) continue;
     // ICMP noise on datagram sockets: drop it and look again.
@@ -235,6 +236,8 @@ int WSASend(SOCKET s, WSABUF* lpBuffers, DWORD dwBufferCount, DWORD* lpNumberOfB
   }
   if (lpBuffers == nullptr || dwBufferCount == 0 || dwBufferCount > 8) return detail::fail(WSAEINVAL);
   if (lpOverlapped == nullptr || lpCompletionRoutine == nullptr) return detail::fail(WSAEINVAL);
+  // Completions come back through this thread's reactor.
+  if (!detail::Reactor::current()->ready()) return SOCKET_ERROR;
   std::lock_guard<std::mutex> hold(socket->lock);
   if (socket->closed) return detail::fail(WSAENOTSOCK);
   if (socket->type == wsa::sockStream) {
@@ -260,6 +263,8 @@ int WSARecv(SOCKET s, WSABUF* lpBuffers, DWORD dwBufferCount, DWORD* lpNumberOfB
   if (!socket) return detail::fail(WSAENOTSOCK);
   if (lpBuffers == nullptr || dwBufferCount == 0 || dwBufferCount > 8) return detail::fail(WSAEINVAL);
   if (lpOverlapped == nullptr || lpCompletionRoutine == nullptr) return detail::fail(WSAEINVAL);
+  // Completions come back through this thread's reactor.
+  if (!detail::Reactor::current()->ready()) return SOCKET_ERROR;
   std::lock_guard<std::mutex> hold(socket->lock);
   if (socket->closed) return detail::fail(WSAENOTSOCK);
   // Posting a read re-enables FD_READ, whatever comes of it.

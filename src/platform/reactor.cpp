@@ -1,23 +1,29 @@
 // The per-thread reactor: completion queue and wake-up descriptor.
 #include "internal.h"  // first: see the note there
+#include "syscalls.h"
 
 #include <sys/eventfd.h>
 #include <unistd.h>
 
 #include <algorithm>
-#include <cstdlib>
+#include <cerrno>
 
 namespace platform::detail {
 
-Reactor::Reactor() {
-  wakeFd_ = ::eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC);
-  if (wakeFd_ < 0) std::abort();  // a thread that can't be woken can't wait safely
-}
+Reactor::Reactor() { ready(); }
 
 Reactor::~Reactor() {
   // Completions that were never run belong to a thread that has ended; their
   // records are owned by whoever issued them.
-  ::close(wakeFd_);
+  if (wakeFd_ >= 0) ::close(wakeFd_);
+}
+
+bool Reactor::ready() {
+  if (wakeFd_ >= 0) return true;
+  wakeFd_ = sys::eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC);
+  if (wakeFd_ >= 0) return true;
+  fail(wsaErrorFromErrno(errno));
+  return false;
 }
 
 namespace {
@@ -61,12 +67,14 @@ bool Reactor::runCompletions() {
 }
 
 void Reactor::wake() {
+  if (wakeFd_ < 0) return;  // its owner can't wait on the network until it has one
   std::uint64_t one = 1;
   ssize_t rc = ::write(wakeFd_, &one, sizeof one);
   (void)rc;  // a full counter already means "wake up"
 }
 
 void Reactor::drainWake() {
+  if (wakeFd_ < 0) return;
   std::uint64_t count;
   ssize_t rc = ::read(wakeFd_, &count, sizeof count);
   (void)rc;

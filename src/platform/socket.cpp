@@ -1,5 +1,6 @@
 // Socket creation, naming, options, connecting, accepting and closing.
 #include "internal.h"  // first: see the note there
+#include "syscalls.h"
 
 #include <netinet/in.h>
 #include <netinet/tcp.h>
@@ -117,7 +118,7 @@ SOCKET WSASocketA(int af, int type, int protocol, const WSAPROTOCOL_INFOA* lpPro
   }
   // Every socket is non-blocking: this layer offers the overlapped and
   // event-selected model only.
-  int fd = ::socket(linuxFamily, linuxType | SOCK_NONBLOCK | SOCK_CLOEXEC, protocol);
+  int fd = sys::socket(linuxFamily, linuxType | SOCK_NONBLOCK | SOCK_CLOEXEC, protocol);
   if (fd < 0) {
     failFromErrno(errno);
     return INVALID_SOCKET;
@@ -323,7 +324,7 @@ SOCKET WSAAccept(SOCKET s, sockaddr* addr, int* addrlen, LPCONDITIONPROC lpfnCon
   }
   ::sockaddr_in peer{};
   socklen_t length = sizeof peer;
-  int fd = ::accept4(listener->fd, reinterpret_cast<::sockaddr*>(&peer), &length, SOCK_NONBLOCK | SOCK_CLOEXEC);
+  int fd = sys::accept4(listener->fd, reinterpret_cast<::sockaddr*>(&peer), &length, SOCK_NONBLOCK | SOCK_CLOEXEC);
   if (fd < 0) {
     failFromErrno(errno);
     return INVALID_SOCKET;

@@ -2,6 +2,7 @@
 // network. It polls the wake descriptor of its reactor, the sockets whose
 // events it waits on, and the sockets with its own operations under way.
 #include "internal.h"  // first: see the note there
+#include "syscalls.h"
 
 #include <poll.h>
 
@@ -69,6 +70,7 @@ int remainingMilliseconds(bool infinite, Clock::time_point deadline) {
 
 DWORD waitForEvents(DWORD count, const WSAEVENT* handles, DWORD milliseconds, bool alertable) {
   const std::shared_ptr<Reactor>& self = Reactor::current();
+  if (!self->ready()) return WSA_WAIT_FAILED;
   std::shared_ptr<EventObject> events[WSA_MAXIMUM_WAIT_EVENTS];
   for (DWORD i = 0; i < count; ++i) {
     events[i] = findEvent(handles[i]);
@@ -114,7 +116,7 @@ DWORD waitForEvents(DWORD count, const WSAEVENT* handles, DWORD milliseconds, bo
     // Completions posted by other threads, or an event set, after the checks
     // above have written the wake descriptor, so this poll returns at once.
     int timeout = (alertable && self->hasCompletions()) ? 0 : remainingMilliseconds(infinite, deadline);
-    int ready = ::poll(set.fds.data(), set.fds.size(), timeout);
+    int ready = sys::poll(set.fds.data(), set.fds.size(), timeout);
     int pollError = ready < 0 ? errno : 0;
     {
       std::lock_guard<std::mutex> hold(eventLock());
