@@ -4,18 +4,9 @@
 
 #include "N_Initializer.h"
 #include "RuntimeLock.h"
+#include "socket_options.h"
 #include "win32.h"
 #include "winsock.h"
-
-namespace {
-
-constexpr int kBufferSize = 65536;
-
-void setIntOption(platform::SOCKET s, int option, int value) {
-  platform::setsockopt(s, platform::SOL_SOCKET, option, reinterpret_cast<const char*>(&value), sizeof value);
-}
-
-}  // namespace
 
 N_Listener::N_Listener(int port) {
   initializeMembers();
@@ -53,9 +44,7 @@ void N_Listener::construct(int port) {
   m_socket =
       N_Socket::chkErr(platform::WSASocketA(platform::FROM_PROTOCOL_INFO, platform::FROM_PROTOCOL_INFO,
                                             platform::FROM_PROTOCOL_INFO, provider, 0, platform::WSA_FLAG_OVERLAPPED));
-  setIntOption(m_socket, platform::SO_RCVBUF, kBufferSize);
-  setIntOption(m_socket, platform::SO_SNDBUF, kBufferSize);
-  setIntOption(m_socket, platform::SO_REUSEADDR, 1);
+  setBufferOptions(m_socket, true);
   // Selected before bind and listen; the network thread only waits on the
   // event once the registry below has it.
   N_Socket::chkErr(platform::WSAEventSelect(m_socket, m_event, platform::FD_ACCEPT));

@@ -11,6 +11,7 @@
 #include "Q_New.h"
 #include "Q_Throw.h"
 #include "RuntimeLock.h"
+#include "socket_options.h"
 #include "win32.h"
 #include "winsock.h"
 
@@ -18,11 +19,6 @@ namespace {
 
 // FD_READ | FD_WRITE | FD_CONNECT | FD_CLOSE
 constexpr long kSocketEvents = 51;
-constexpr int kBufferSize = 65536;
-
-void setIntOption(platform::SOCKET s, int option, int value) {
-  platform::setsockopt(s, platform::SOL_SOCKET, option, reinterpret_cast<const char*>(&value), sizeof value);
-}
 
 }  // namespace
 
@@ -51,7 +47,7 @@ void N_Socket::initializeMembers() {
   m_socket = 0;
   m_event = nullptr;
   m_pRegistryEntry = nullptr;
-  m_iMaximumSendPacketSize = kBufferSize;
+  m_iMaximumSendPacketSize = kSocketBufferSize;
   m_bConnected = false;
   m_bEventPending = false;
   m_bOwnsAddress = false;
@@ -74,17 +70,8 @@ void N_Socket::initializeMembers() {
 }
 
 void N_Socket::baseConstructor() {
+  initializeMembers();
   m_pReceiveQueue = Q_New<Q_DLList<DataQueue>>();
-  m_pAddress = nullptr;
-  m_iPort = 0;
-  m_socketType = SOCKET_TCP;
-  m_bConnected = false;
-  m_bOwnsAddress = false;
-  m_bWritable = false;
-  m_bWriteCompletionPending = false;
-  m_iPacketBytesMissing = 0;
-  m_iPacketBytesHave = 0;
-  m_bStreamBroken = false;
   m_bConstructed = true;
   m_bPackage = true;
   std::memset(&m_remoteAddress, 0, sizeof m_remoteAddress);
@@ -100,8 +87,7 @@ void N_Socket::construct(ConnectData* data) {
     m_remoteAddress = data->address;
     m_bConnected = true;
     m_socket = data->socket;
-    setIntOption(m_socket, platform::SO_RCVBUF, kBufferSize);
-    setIntOption(m_socket, platform::SO_SNDBUF, kBufferSize);
+    setBufferOptions(m_socket, false);
     int limit = 0;
     int length = sizeof limit;
     if (platform::getsockopt(m_socket, platform::SOL_SOCKET, platform::SO_SNDBUF, reinterpret_cast<char*>(&limit),
@@ -157,9 +143,7 @@ void N_Socket::construct(const N_Address* address, int port, SocketType type) {
     m_socket = chkErr(platform::WSASocketA(platform::FROM_PROTOCOL_INFO, platform::FROM_PROTOCOL_INFO,
                                            platform::FROM_PROTOCOL_INFO, provider, 0, platform::WSA_FLAG_OVERLAPPED));
     chkErr(platform::WSAEventSelect(m_socket, m_event, kSocketEvents));
-    setIntOption(m_socket, platform::SO_RCVBUF, kBufferSize);
-    setIntOption(m_socket, platform::SO_SNDBUF, kBufferSize);
-    setIntOption(m_socket, platform::SO_REUSEADDR, 1);
+    setBufferOptions(m_socket, true);
     int limit = 0;
     int length = sizeof limit;
     if (platform::getsockopt(m_socket, platform::SOL_SOCKET,
