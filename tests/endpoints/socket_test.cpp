@@ -5,6 +5,7 @@
 // which raw Linux peers read and write byte by byte (where the exact cut of a
 // read matters, the read is fed to the receive path directly).
 #include <algorithm>
+#include <cstring>
 #include <filesystem>
 #include <iterator>
 #include <memory>
@@ -13,6 +14,7 @@
 #include <utility>
 
 #include "endpoint_test.h"
+#include "Q_System.h"
 #include "guards.h"
 
 namespace {
@@ -173,6 +175,30 @@ TEST_F(SocketTest, ReceiveMayDestroyItsSocketOrPoll) {
     if (mode != DELETE) delete in;
     raw::closeFd(fd);
   }
+}
+
+// An exception out of receive() is dropped with a diagnostic line naming
+// it; the message stays for poll() and the connection goes on.
+TEST_F(SocketTest, AThrowingReceiveLeavesATraceAndItsMessage) {
+  static std::atomic<int> traces{0};
+  Sys->setVerboseSink([](const char* line) { traces += std::strstr(line, "receive: ") != nullptr; });
+  struct Throwing : N_Socket {
+    ~Throwing() { destruct(); }
+    bool receive(void*, unsigned) override { throw 7; }
+  } in;
+  N_Listener listener(port());
+  int fd = -1;
+  ASSERT_TRUE(acceptRaw(listener, port(), in, fd));
+  ASSERT_TRUE(rawSend(fd, concat({framed(pattern(5, 1)), framed(pattern(6, 2))})));
+  Bytes got;
+  for (std::size_t size : {5u, 6u}) {
+    ASSERT_TRUE(pollMessage(in, got, 5000));
+    EXPECT_EQ(size, got.size());
+  }
+  EXPECT_EQ(2, traces.load());
+  EXPECT_TRUE(in.isConnected());
+  Sys->setVerboseSink(nullptr);
+  raw::closeFd(fd);
 }
 
 // Sends still queued and reads still under way when their socket goes: the
