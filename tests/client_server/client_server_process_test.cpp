@@ -111,9 +111,11 @@ TEST_P(ClientsTest, ExchangeAndLeave) {
   for (int i = 0; i < count; ++i) {
     EXPECT_EQ(inOrder, reliable[clients[i]]) << peers[i]->host();
     EXPECT_TRUE(peers[i]->waitLine("e" + std::to_string(kPayloads - 1) + ";", 20000, serve)) << peers[i]->host();
+    // Measured (replies carry no number: one that comes after the next
+    // heartbeat left, from a server slower than the frequency, measures next
+    // to nothing, so only the bound above is checked).
     auto latency = peers[i]->waitLine("latency", 5000, serve);
     ASSERT_TRUE(latency) << peers[i]->host();
-    EXPECT_GT(valueOf(*latency), 0.0);
     EXPECT_LT(valueOf(*latency), 1.0);
     EXPECT_TRUE(waitFor([&] { return clients[i]->getLatency() > 0.0f; }, 5000, serve));
     EXPECT_LT(clients[i]->getLatency(), 1.0f);
