@@ -110,7 +110,7 @@ int clientPeer(const char* host, int port, double seconds) {
 
 namespace {
 
-void twentyClients(double seconds) {
+void twentyClients(double seconds, ClientServerFigures& figures) {
   int port = bench::freePort();
   N_Server server(port);
   std::vector<pid_t> children;
@@ -160,14 +160,21 @@ void twentyClients(double seconds) {
               cpu / wall * 100.0);
   std::printf("  delivered:  %lu payloads, %.1f%% of %.0f sent at 60 Hz\n", received,
               expected > 0 ? 100.0 * received / expected : 0.0, expected);
+  figures.clients = clients.size();
+  figures.seconds = wall;
+  figures.serverCpuPercent = cpu / wall * 100.0;
+  figures.deliveredPercent = expected > 0 ? 100.0 * received / expected : 0.0;
 }
 
 }  // namespace
 
-void benchClientServer(bool quick) {
-  int rounds = quick ? 500 : 5000;
-  bench::Latency payload = payloadRoundTrip(rounds);
-  std::printf("\nPayload round trip (32 bytes, queueReliable + flushReliable + poll, %d rounds)\n", rounds);
-  std::printf("  median %.1f us, p99 %.1f us\n", payload.medianMicros, payload.p99Micros);
-  twentyClients(quick ? 3.0 : 10.0);
+ClientServerFigures benchClientServer(bool quick) {
+  ClientServerFigures figures;
+  figures.payloadRounds = quick ? 500 : 5000;
+  figures.payload = payloadRoundTrip(figures.payloadRounds);
+  std::printf("\nPayload round trip (32 bytes, queueReliable + flushReliable + poll, %d rounds)\n",
+              figures.payloadRounds);
+  std::printf("  median %.1f us, p99 %.1f us\n", figures.payload.medianMicros, figures.payload.p99Micros);
+  twentyClients(quick ? 3.0 : 10.0, figures);
+  return figures;
 }

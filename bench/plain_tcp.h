@@ -17,6 +17,7 @@ struct Throughput {
 struct Latency {
   double medianMicros = 0;
   double p99Micros = 0;
+  std::size_t samples = 0;  // round trips completed and checked; fewer than asked means one failed
 };
 
 // Fills `out` with the pattern of message `index`; checks it on the way in.

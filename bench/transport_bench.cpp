@@ -1,10 +1,15 @@
 // Transport benchmark: message sockets of the library against a plain TCP
-// socket pair with the same framing, measured side by side in one run.
+// socket pair with the same framing and, where their development packages were
+// found at build time, ENet and ZeroMQ, all measured in one run.
 //
-//   vardel_bench [--quick]
+//   vardel_bench [--quick] [--rounds N] [--json FILE]
 //
-// Throughput is one-way, every message checked byte for byte at the receiver.
-// The round trip is a 32-byte message echoed by the peer.
+// Throughput is one-way, every message checked (size, content, order) at the
+// receiver. The round trip is a 32-byte message echoed by the peer. Each
+// figure is the median of several rounds (7 by default, 3 with --quick; three
+// times as many, shorter ones for the round trip); within a round every
+// transport runs once, in an order that rotates from round to round, so that
+// a slow spell of the machine falls on all of them alike.
 #include <atomic>
 #include <chrono>
 #include <condition_variable>
@@ -20,7 +25,9 @@
 #include "N_Listener.h"
 #include "N_Socket.h"
 #include "bench_client_server.h"
+#include "peer_transports.h"
 #include "plain_tcp.h"
+#include "report.h"
 #include "win32.h"
 
 namespace {
@@ -32,12 +39,15 @@ class CheckingSocket : public N_Socket {
  public:
   ~CheckingSocket() { destruct(); }  // before the derived part goes: the network thread may call receive()
   std::size_t expectedSize = 0;
+  std::uint64_t expectedCount = 0;
   std::atomic<std::uint64_t> received{0};
   std::atomic<bool> corrupt{false};
+  Clock::time_point last;  // when the last message was checked; read after `received` reaches the count
   bool receive(void* data, unsigned int size) override {
     std::uint64_t index = received.load(std::memory_order_relaxed);
     if (size != expectedSize || !bench::checkMessage(static_cast<const std::uint8_t*>(data), size, index))
       corrupt.store(true);
+    if (index + 1 == expectedCount) last = Clock::now();
     received.store(index + 1, std::memory_order_release);
     return false;
   }
@@ -102,6 +112,7 @@ bench::Throughput libraryThroughput(std::size_t size, std::size_t count) {
   CheckingSocket in;
   N_Socket out;
   in.expectedSize = size;
+  in.expectedCount = count;
   if (!connectPair(listener, address, port, in, out)) return t;
   std::vector<std::uint8_t> message;
   auto start = Clock::now();
@@ -115,8 +126,10 @@ bench::Throughput libraryThroughput(std::size_t size, std::size_t count) {
   }
   auto deadline = Clock::now() + std::chrono::seconds(60);
   while (in.received.load(std::memory_order_acquire) < count && Clock::now() < deadline) platform::Sleep(1);
-  double seconds = std::chrono::duration<double>(Clock::now() - start).count();
-  t.verified = in.received.load() == count && !in.corrupt.load();
+  // The receiver's clock, not this loop's: the sleep above would add up to a
+  // millisecond.
+  t.verified = in.received.load(std::memory_order_acquire) == count && !in.corrupt.load();
+  double seconds = std::chrono::duration<double>((t.verified ? in.last : Clock::now()) - start).count();
   t.messagesPerSecond = static_cast<double>(count) / seconds;
   t.megabytesPerSecond = static_cast<double>(count * size) / seconds / 1e6;
   return t;
@@ -136,13 +149,49 @@ bench::Latency libraryRoundTrip(std::size_t size, int rounds) {
     auto start = Clock::now();
     client.send(message.data(), static_cast<unsigned>(size));
     if (!client.waitReply(5000)) break;
-    micros.push_back(std::chrono::duration<double, std::micro>(Clock::now() - start).count());
-    if (!bench::checkMessage(client.reply.data(), client.reply.size(), static_cast<std::uint64_t>(i))) {
+    double micro = std::chrono::duration<double, std::micro>(Clock::now() - start).count();
+    if (client.reply.size() != size ||
+        !bench::checkMessage(client.reply.data(), client.reply.size(), static_cast<std::uint64_t>(i))) {
       std::fprintf(stderr, "round trip: reply %d corrupt\n", i);
       break;
     }
+    micros.push_back(micro);
   }
   return bench::summarize(micros);
+}
+
+struct Transport {
+  std::string name;
+  bench::Throughput (*throughput)(std::size_t size, std::size_t count);
+  bench::Latency (*roundTrip)(std::size_t size, int rounds);
+};
+
+std::vector<Transport> transports(bench::Report& report) {
+  std::vector<Transport> all = {{"plain TCP", bench::plainThroughput, bench::plainRoundTrip},
+                                {"vardel", libraryThroughput, libraryRoundTrip}};
+  report.library = 1;
+#ifdef VARDEL_BENCH_ENET
+  all.push_back({"ENet", bench::enetThroughput, bench::enetRoundTrip});
+  report.versions.push_back("ENet " + bench::enetVersion() + " reliable channel, enet_host_service 1 ms");
+#endif
+#ifdef VARDEL_BENCH_ZMQ
+  all.push_back({"ZeroMQ", bench::zmqThroughput, bench::zmqRoundTrip});
+  report.versions.push_back("ZeroMQ " + bench::zmqVersion() + " PUSH/PULL and REQ/REP over tcp");
+#endif
+  for (const Transport& t : all) report.transports.push_back(t.name);
+  return all;
+}
+
+bench::Measure measure(const std::string& name, const std::string& unit, bool higherIsBetter, std::size_t count,
+                       std::size_t transportCount) {
+  bench::Measure m;
+  m.name = name;
+  m.unit = unit;
+  m.higherIsBetter = higherIsBetter;
+  m.count = count;
+  m.rounds.resize(transportCount);
+  m.verified.assign(transportCount, true);
+  return m;
 }
 
 }  // namespace
@@ -151,10 +200,22 @@ int main(int argc, char** argv) {
   if (argc == 5 && std::strcmp(argv[1], "--client-peer") == 0)
     return clientPeer(argv[2], std::atoi(argv[3]), std::atof(argv[4]));
   bool quick = false;
-  std::size_t only = 0;  // --size N: one throughput case alone, for profiling
+  int rounds = 0;
+  std::string json;
+  std::size_t only = 0;  // --size N: one throughput case of the library alone, for profiling
   for (int i = 1; i < argc; ++i) {
-    if (std::strcmp(argv[i], "--quick") == 0) quick = true;
-    if (std::strcmp(argv[i], "--size") == 0 && i + 1 < argc) only = std::strtoul(argv[++i], nullptr, 10);
+    if (std::strcmp(argv[i], "--quick") == 0) {
+      quick = true;
+    } else if (std::strcmp(argv[i], "--size") == 0 && i + 1 < argc) {
+      only = std::strtoul(argv[++i], nullptr, 10);
+    } else if (std::strcmp(argv[i], "--rounds") == 0 && i + 1 < argc) {
+      rounds = std::atoi(argv[++i]);
+    } else if (std::strcmp(argv[i], "--json") == 0 && i + 1 < argc) {
+      json = argv[++i];
+    } else {
+      std::fprintf(stderr, "usage: %s [--quick] [--rounds N] [--json FILE] | --size BYTES\n", argv[0]);
+      return 2;
+    }
   }
   N_Initializer network;
   if (only != 0) {
@@ -163,34 +224,75 @@ int main(int argc, char** argv) {
                 lib.verified ? "" : " (VERIFY FAILED)");
     return 0;
   }
-  std::printf("Transport: one-way throughput over loopback, every message checked\n");
-  std::printf("%10s %10s | %12s %9s | %12s %9s | %7s\n", "size", "messages", "plain msg/s", "MB/s", "vardel msg/s",
-              "MB/s", "ratio");
+  if (rounds <= 0) rounds = quick ? 3 : 7;
+  // A round trip depends on where the scheduler puts the threads, which is
+  // drawn afresh with each round's threads: more and shorter rounds for it.
+  const int latencyRounds = 3 * rounds;
+
+  bench::Report report;
+  report.loadBefore = bench::loadAverage();
+  report.rounds = rounds;
+  report.quick = quick;
+  std::vector<Transport> all = transports(report);
+  const std::size_t n = all.size();
+
+  // Counts per round: a fraction of a second each for the fast transports.
   struct Case {
+    const char* name;
+    const char* unit;
     std::size_t size;
     std::size_t count;
   };
-  const Case cases[] = {{64, quick ? 50000u : 500000u},
-                        {1024, quick ? 20000u : 200000u},
-                        {65536, quick ? 1000u : 10000u},
-                        {200000, quick ? 300u : 3000u}};
+  const Case cases[] = {{"64 B messages", "msg/s", 64, quick ? 40000u : 200000u},
+                        {"1 KiB messages", "MB/s", 1024, quick ? 20000u : 100000u},
+                        {"64 KiB messages", "MB/s", 65536, quick ? 500u : 3000u},
+                        {"200000 B messages", "MB/s", 200000, quick ? 200u : 1000u}};
+  const int roundTrips = quick ? 500 : 2000;
+
+  std::printf("Measuring %zu transports, %d rounds (round trip %d):", n, rounds, latencyRounds);
+  for (const Transport& t : all) std::printf(" %s", t.name.c_str());
+  std::printf("\n");
   for (const Case& c : cases) {
-    bench::Throughput plain = bench::plainThroughput(c.size, c.count);
-    bench::Throughput lib = libraryThroughput(c.size, c.count);
-    std::printf("%10zu %10zu | %12.0f %9.1f | %12.0f %9.1f | %6.2fx%s\n", c.size, c.count, plain.messagesPerSecond,
-                plain.megabytesPerSecond, lib.messagesPerSecond, lib.megabytesPerSecond,
-                lib.messagesPerSecond / plain.messagesPerSecond,
-                (plain.verified && lib.verified) ? "" : "  (VERIFY FAILED)");
+    bench::Measure m = measure(c.name, c.unit, true, c.count, n);
+    for (int r = 0; r < rounds; ++r) {
+      for (std::size_t k = 0; k < n; ++k) {
+        std::size_t t = (k + static_cast<std::size_t>(r)) % n;
+        bench::Throughput got = all[t].throughput(c.size, c.count);
+        m.rounds[t].push_back(c.size == 64 ? got.messagesPerSecond : got.megabytesPerSecond);
+        if (!got.verified) m.verified[t] = false;
+      }
+    }
+    std::printf("  %s done\n", c.name);
+    std::fflush(stdout);
+    report.measures.push_back(std::move(m));
   }
-  int rounds = quick ? 2000 : 20000;
-  bench::Latency plainRtt = bench::plainRoundTrip(32, rounds);
-  bench::Latency libRtt = libraryRoundTrip(32, rounds);
-  std::printf("\nRound trip of a 32-byte message (%d rounds)\n", rounds);
-  std::printf("%10s | %10s %10s\n", "", "median us", "p99 us");
-  std::printf("%10s | %10.1f %10.1f\n", "plain", plainRtt.medianMicros, plainRtt.p99Micros);
-  std::printf("%10s | %10.1f %10.1f\n", "vardel", libRtt.medianMicros, libRtt.p99Micros);
-  std::printf("%10s | %9.2fx %9.2fx\n", "ratio", libRtt.medianMicros / plainRtt.medianMicros,
-              libRtt.p99Micros / plainRtt.p99Micros);
-  benchClientServer(quick);
-  return 0;
+  bench::Measure median = measure("32 B round trip", "us", false, static_cast<std::size_t>(roundTrips), n);
+  bench::Measure p99 = measure("32 B round trip p99", "us", false, static_cast<std::size_t>(roundTrips), n);
+  for (int r = 0; r < latencyRounds; ++r) {
+    for (std::size_t k = 0; k < n; ++k) {
+      std::size_t t = (k + static_cast<std::size_t>(r)) % n;
+      bench::Latency got = all[t].roundTrip(32, roundTrips);
+      median.rounds[t].push_back(got.medianMicros);
+      p99.rounds[t].push_back(got.p99Micros);
+      if (got.samples != static_cast<std::size_t>(roundTrips)) median.verified[t] = p99.verified[t] = false;
+    }
+  }
+  report.measures.push_back(std::move(median));
+  report.measures.push_back(std::move(p99));
+  report.latencyRounds = latencyRounds;
+  report.loadAfter = bench::loadAverage();
+  printTable(report);
+
+  ClientServerFigures clientServer = benchClientServer(quick);
+  if (!json.empty()) {
+    if (!bench::writeJson(report, clientServer, json)) {
+      std::fprintf(stderr, "could not write %s\n", json.c_str());
+      return 1;
+    }
+    std::printf("\nwrote %s\n", json.c_str());
+  }
+  bool allVerified = true;
+  for (const bench::Measure& m : report.measures)
+    for (bool v : m.verified) allVerified = allVerified && v;
+  return allVerified ? 0 : 1;
 }

@@ -6,7 +6,9 @@ set -euo pipefail
 # cmake/ninja/g++ build the library; clang with clang's runtime
 # (libclang_rt.fuzzer and the sanitizer runtimes) builds the fuzz targets;
 # GoogleTest/GoogleMock the tests; Google Benchmark the benchmark program;
-# tshark runs the Wireshark dissector over captured test traffic, doxygen
+# ENet and ZeroMQ are the transports the benchmark program compares with
+# (it leaves their columns out without them), matplotlib draws its ratio
+# chart; tshark runs the Wireshark dissector over captured test traffic, doxygen
 # makes the API reference, dpkg-dev checks the Debian packages.
 PACKAGES=(
   cmake
@@ -17,6 +19,9 @@ PACKAGES=(
   libgtest-dev
   libgmock-dev
   libbenchmark-dev
+  libenet-dev
+  libzmq3-dev
+  python3-matplotlib
   pkg-config
   tshark
   doxygen
