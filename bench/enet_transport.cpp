@@ -125,8 +125,7 @@ Throughput enetThroughput(std::size_t size, std::size_t count) {
   reader.join();
   double seconds = std::chrono::duration<double>(last - start).count();
   t.verified = ok;
-  t.messagesPerSecond = static_cast<double>(count) / seconds;
-  t.megabytesPerSecond = static_cast<double>(count * size) / seconds / 1e6;
+  setRates(t, count, size, seconds);
   return t;
 }
 

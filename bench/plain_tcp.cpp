@@ -160,8 +160,7 @@ Throughput plainThroughput(std::size_t size, std::size_t count) {
   reader.join();
   double seconds = std::chrono::duration<double>(Clock::now() - start).count();
   t.verified = ok;
-  t.messagesPerSecond = static_cast<double>(count) / seconds;
-  t.megabytesPerSecond = static_cast<double>(count * size) / seconds / 1e6;
+  setRates(t, count, size, seconds);
   ::close(a);
   ::close(b);
   return t;

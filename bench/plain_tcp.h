@@ -14,6 +14,12 @@ struct Throughput {
   bool verified = false;
 };
 
+// The rates of `count` messages of `size` bytes in `seconds`.
+inline void setRates(Throughput& t, std::size_t count, std::size_t size, double seconds) {
+  t.messagesPerSecond = static_cast<double>(count) / seconds;
+  t.megabytesPerSecond = static_cast<double>(count * size) / seconds / 1e6;
+}
+
 struct Latency {
   double medianMicros = 0;
   double p99Micros = 0;

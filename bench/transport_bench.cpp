@@ -130,8 +130,7 @@ bench::Throughput libraryThroughput(std::size_t size, std::size_t count) {
   // millisecond.
   t.verified = in.received.load(std::memory_order_acquire) == count && !in.corrupt.load();
   double seconds = std::chrono::duration<double>((t.verified ? in.last : Clock::now()) - start).count();
-  t.messagesPerSecond = static_cast<double>(count) / seconds;
-  t.megabytesPerSecond = static_cast<double>(count * size) / seconds / 1e6;
+  setRates(t, count, size, seconds);
   return t;
 }
 
