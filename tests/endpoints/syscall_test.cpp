@@ -46,14 +46,19 @@ bool isStream(int fd) {
   return ::getsockopt(fd, SOL_SOCKET, SO_TYPE, &type, &length) == 0 && type == SOCK_STREAM;
 }
 
-// Every fourth call interrupted, every fourth refused for now; the rest
-// write three bytes at most of a stream (a datagram goes whole or not).
+// The first call of every `cycle` is interrupted, the second refused for
+// now (errno set, true); the others go on.
+bool interrupted(std::atomic<int>& calls, int cycle) {
+  const int turn = calls++ % cycle;
+  if (turn > 1) return false;
+  errno = turn == 0 ? EINTR : EAGAIN;
+  return true;
+}
+
+// The rest write three bytes at most of a stream (a datagram goes whole or
+// not).
 long choppySendmsg(int fd, const msghdr* message, int flags) {
-  switch (g_sends++ % 4) {
-    case 0: errno = EINTR; return -1;
-    case 1: errno = EAGAIN; return -1;
-    default: break;
-  }
+  if (interrupted(g_sends, 4)) return -1;
   if (!isStream(fd)) return ::sendmsg(fd, message, flags);
   iovec iov[1024];
   msghdr shorter = cut(message, iov, 3);
@@ -61,11 +66,7 @@ long choppySendmsg(int fd, const msghdr* message, int flags) {
 }
 
 long choppyRecvmsg(int fd, msghdr* message, int flags) {
-  switch (g_receives++ % 3) {
-    case 0: errno = EINTR; return -1;
-    case 1: errno = EAGAIN; return -1;
-    default: break;
-  }
+  if (interrupted(g_receives, 3)) return -1;
   if (!isStream(fd)) return ::recvmsg(fd, message, flags);
   iovec iov[8];
   msghdr shorter = cut(message, iov, 5);
