@@ -390,6 +390,20 @@ class VARDEL_API N_Client {
   static void clearQueue(Q_DLList<DataQueue>* queue, unsigned& bytes);
   static int flushCompareQSort(const void* a, const void* b);
 
+  // The server end's side of pairing and bandwidth (server_end.cpp): N_Server
+  // works on its clients through these and touches no field of theirs.
+  bool isPaired() const { return m_pControlSocket != nullptr; }
+  float getUnpairedAge() const { return m_pairingTimer.getAge(); }
+  bool isDataConnected() const;
+  void pair(N_Socket* pControlSocket);
+  bool takeNewConnection();
+  void recordBandwidthRequest(unsigned uRequested, bool bCollected);
+  unsigned getRequestedBandwidth() const { return m_uRequestedBandwidth; }
+  void grantBandwidth(unsigned uGrant, bool bChangedOnly);
+  // The most that one channel's queued sends cost (N_Limits::kMessageCharge).
+  double getLargestSendBacklog() const;
+  N_Socket* getControlSocket() const { return m_pControlSocket; }
+
   bool m_bNewConnection;
   N_Socket* m_pControlSocket;
   unsigned m_uRequestedBandwidth;

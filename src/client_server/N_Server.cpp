@@ -171,7 +171,7 @@ void N_Server::rejectUnlessTaken(N_Socket::ConnectData* data, platform::SOCKET s
   // newer entry may stand at its address now; that one holds another handle,
   // since a handle comes back only after 2^24 reuses of its slot.
   RuntimeLock hold;
-  Q_DLList<N_Socket::ConnectData>* queue = N_Initializer::m_pConnectQueue;
+  Q_DLList<N_Socket::ConnectData>* queue = Runtime::connects();
   for (N_Socket::ConnectData* entry = queue != nullptr ? queue->getFirst() : nullptr; entry != nullptr;
        entry = queue->getNext(entry)) {
     if (entry == data && entry->socket == socket) {
@@ -196,13 +196,13 @@ bool N_Server::admitUnpaired(const N_Limits& limits, unsigned identifier, bool c
   double oldestAge = -1.0;
   for (N_Client** entry = m_pClients->getFirst(); entry != nullptr; entry = m_pClients->getNext(entry)) {
     N_Client* client = *entry;
-    if (client->m_pControlSocket != nullptr) continue;
+    if (client->isPaired()) continue;
     ++all;
     if (client->getAddress()->getIdentifier() == identifier) {
       ++same;
       if (control) ++partners;
-    } else if (client->m_pairingTimer.getAge() > oldestAge) {
-      oldestAge = client->m_pairingTimer.getAge();
+    } else if (client->getUnpairedAge() > oldestAge) {
+      oldestAge = client->getUnpairedAge();
       oldestClient = entry;
       oldestControl = nullptr;
     }
@@ -240,8 +240,7 @@ void N_Server::dropUnpaired(float timeout) {
   for (N_Client** entry = m_pClients->getFirst(); entry != nullptr;) {
     N_Client** next = m_pClients->getNext(entry);
     N_Client* client = *entry;
-    if (client->m_pControlSocket == nullptr &&
-        (client->m_pairingTimer.getAge() > timeout || !client->m_pTcpSocket->isConnected())) {
+    if (!client->isPaired() && (client->getUnpairedAge() > timeout || !client->isDataConnected())) {
       freeClient(client);
       m_pClients->remove(entry);
     }
@@ -266,11 +265,8 @@ void N_Server::pair() {
     const unsigned identifier = pending->pSocket->getAddress()->getIdentifier();
     for (N_Client** entry = m_pClients->getFirst(); entry != nullptr; entry = m_pClients->getNext(entry)) {
       N_Client* client = *entry;
-      if (client->m_pControlSocket != nullptr || client->getAddress()->getIdentifier() != identifier) continue;
-      client->m_pControlSocket = pending->pSocket;
-      client->m_bNewConnection = true;
-      client->m_heartbeatTimer.reset();
-      client->m_heartbeatIdleTimer.reset();
+      if (client->isPaired() || client->getAddress()->getIdentifier() != identifier) continue;
+      client->pair(pending->pSocket);
       m_pPendingControlSockets->remove(pending);
       break;
     }
@@ -280,18 +276,13 @@ void N_Server::pair() {
 
 bool N_Server::sendBacklogExceeded(N_Client* client, const N_Limits& limits) {
   if (limits.fSendBacklogSeconds <= 0.0f || !client->isConnected()) return false;
-  double bound = static_cast<double>(limits.fSendBacklogSeconds) * client->m_uBandwidth;
+  double bound = static_cast<double>(limits.fSendBacklogSeconds) * client->getBandwidth();
   if (bound < limits.uMinimumSendBacklog) bound = limits.uMinimumSendBacklog;
-  for (N_Socket* socket : {client->m_pTcpSocket, client->m_pUdpSocket, client->m_pControlSocket}) {
-    if (socket == nullptr) continue;
-    const double cost = socket->getQueuedSendBytes() + double{N_Limits::kMessageCharge} * socket->getQueuedSendMessages();
-    if (cost > bound) return true;
-  }
-  return false;
+  return client->getLargestSendBacklog() > bound;
 }
 
 void N_Server::serveControl(N_Client* client, const N_Limits& limits) {
-  N_Socket* control = client->m_pControlSocket;
+  N_Socket* control = client->getControlSocket();
   if (control == nullptr || !control->isConnected()) return;
   client->stepHeartbeat();
   void* data = nullptr;
@@ -305,9 +296,8 @@ void N_Server::serveControl(N_Client* client, const N_Limits& limits) {
     if (!message.decode(data, size)) continue;
     switch (message.uType) {
       case ControlMessage::CONTROL_BANDWIDTH_REQUEST:
-        client->m_uRequestedBandwidth = message.uValue;
+        client->recordBandwidthRequest(message.uValue, limits.bCoalesceBandwidth);
         if (limits.bCoalesceBandwidth) {
-          client->m_bGrantAsked = true;
           m_bSolveCollected = true;
         } else {
           solveBandwidth();
@@ -338,8 +328,7 @@ bool N_Server::pollConnect(N_Client*& out) {
   if (!m_bServerConstructed) return false;
   Q_MutexLock lock(m_pMutex);
   for (N_Client** entry = m_pClients->getFirst(); entry != nullptr; entry = m_pClients->getNext(entry)) {
-    if ((*entry)->m_bNewConnection) {
-      (*entry)->m_bNewConnection = false;
+    if ((*entry)->takeNewConnection()) {
       out = *entry;
       return true;
     }

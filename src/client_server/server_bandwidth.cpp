@@ -51,18 +51,11 @@ void N_Server::solveBandwidth(bool changedOnly) {
   // Every client counts, paired or not, connected or not.
   unsigned total = 0;
   for (N_Client** entry = m_pClients->getFirst(); entry != nullptr; entry = m_pClients->getNext(entry))
-    total += shareOf((*entry)->m_uRequestedBandwidth, maximum);
+    total += shareOf((*entry)->getRequestedBandwidth(), maximum);
   if (m_pClients->getFirst() == nullptr) return;
   const BandwidthDivision division = divide(budget, total);
   for (N_Client** entry = m_pClients->getFirst(); entry != nullptr; entry = m_pClients->getNext(entry)) {
     N_Client* client = *entry;
-    const unsigned grant = grantOf(division, shareOf(client->m_uRequestedBandwidth, maximum));
-    // By default sent whether it changed or not; a client without a live
-    // control channel keeps the value here and hears nothing.
-    const bool tell = !changedOnly || grant != client->m_uBandwidth || client->m_bGrantAsked;
-    client->m_bGrantAsked = false;
-    client->m_uBandwidth = grant;
-    if (tell && client->m_pControlSocket != nullptr && client->m_pControlSocket->isConnected())
-      N_Client::sendControl(client->m_pControlSocket, ControlMessage::CONTROL_BANDWIDTH_GRANT, grant);
+    client->grantBandwidth(grantOf(division, shareOf(client->getRequestedBandwidth(), maximum)), changedOnly);
   }
 }

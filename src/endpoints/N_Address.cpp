@@ -114,12 +114,9 @@ void N_Address::construct(const char* text) {
 
     // The runtime's lists exist only while it is up; a stop deletes every
     // registered address, so an entry never outlives its list.
-    if (N_Initializer::m_pAddresses != nullptr) {
+    if (Runtime::addresses() != nullptr) {
       RuntimeLock lock;
-      N_Address** entry = N_Initializer::m_pAddresses->append();
-      *entry = this;
-      m_pRegistryEntry = entry;
-      N_Initializer::releaseThreadLoop();
+      m_pRegistryEntry = Runtime::enroll(Runtime::addresses(), this);
     }
   } catch (...) {
     destruct();
@@ -135,9 +132,7 @@ void N_Address::destruct() {
   // takes them the other way round.
   if (m_pRegistryEntry != nullptr) {
     RuntimeLock lock;
-    N_Initializer::m_pAddresses->remove(m_pRegistryEntry);
-    m_pRegistryEntry = nullptr;
-    N_Initializer::releaseThreadLoop();
+    Runtime::withdraw(Runtime::addresses(), m_pRegistryEntry);
   }
 
   if (m_pShared != nullptr) {
@@ -203,7 +198,7 @@ bool N_Address::wait(float seconds) const {
   return timer.getAge() < seconds;
 }
 
-const N_Address* N_Address::getLocalAddress() { return N_Initializer::m_pLocalAddress; }
+const N_Address* N_Address::getLocalAddress() { return Runtime::localAddress(); }
 
 unsigned int N_Address::threadHostByName(void* parameter) {
   SharedState* shared = static_cast<SharedState*>(parameter);

@@ -3,6 +3,7 @@
 #include <cstring>
 
 #include "N_Initializer.h"
+#include "Runtime.h"
 #include "RuntimeLock.h"
 #include "socket_options.h"
 #include "win32.h"
@@ -32,10 +33,10 @@ bool N_Listener::isConstructed() const { return m_bConstructed; }
 void N_Listener::construct(int port) {
   if (m_bConstructed) destruct();
   RuntimeLock lock;
-  N_Initializer::releaseThreadLoop();
+  Runtime::wake();
   m_iPort = port;
   m_event = platform::WSACreateEvent();
-  platform::WSAPROTOCOL_INFOA* provider = N_Initializer::m_tcpProtocol;
+  platform::WSAPROTOCOL_INFOA* provider = Runtime::provider(true);
   m_requestedAddress.sin_family =
       static_cast<std::uint16_t>(provider != nullptr ? provider->iAddressFamily : platform::AF_INET);
   m_requestedAddress.sin_port = platform::htons(static_cast<std::uint16_t>(port));
@@ -55,9 +56,7 @@ void N_Listener::construct(int port) {
   int length = sizeof m_localAddress;
   N_Socket::chkErr(platform::getsockname(m_socket, reinterpret_cast<platform::sockaddr*>(&m_localAddress), &length));
   try {
-    N_Listener** slot = N_Initializer::m_pListeners->append();
-    *slot = this;
-    m_pRegistryEntry = slot;
+    m_pRegistryEntry = Runtime::enroll(Runtime::listeners(), this);
   } catch (...) {
     // Nothing of the attempt stays: the object is left unconstructed.
     N_Socket::chkErr(platform::closesocket(m_socket));
@@ -65,19 +64,17 @@ void N_Listener::construct(int port) {
     initializeMembers();
     throw;
   }
-  N_Initializer::releaseThreadLoop();
+  Runtime::wake();
   m_bConstructed = true;
 }
 
 void N_Listener::destruct() {
   if (!m_bConstructed) return;
   RuntimeLock lock;
-  N_Initializer::releaseThreadLoop();
+  Runtime::wake();
   N_Socket::chkErr(platform::closesocket(m_socket));
   platform::WSACloseEvent(m_event);
-  if (m_pRegistryEntry != nullptr && N_Initializer::m_pListeners != nullptr)
-    N_Initializer::m_pListeners->remove(m_pRegistryEntry);
-  N_Initializer::releaseThreadLoop();
+  Runtime::withdraw(Runtime::listeners(), m_pRegistryEntry);
   initializeMembers();
 }
 
@@ -85,7 +82,7 @@ int N_Listener::getPort() { return m_iPort; }
 
 bool N_Listener::pollConnect(N_Socket::ConnectData*& out) {
   RuntimeLock lock;
-  Q_DLList<N_Socket::ConnectData>* queue = N_Initializer::m_pConnectQueue;
+  Q_DLList<N_Socket::ConnectData>* queue = Runtime::connects();
   if (queue == nullptr) return false;
   for (N_Socket::ConnectData* entry = queue->getFirst(); entry != nullptr; entry = queue->getNext(entry)) {
     if (entry->pListener == this) {
@@ -98,7 +95,7 @@ bool N_Listener::pollConnect(N_Socket::ConnectData*& out) {
 
 bool N_Listener::rejectConnect(N_Socket::ConnectData* data) {
   RuntimeLock lock;
-  Q_DLList<N_Socket::ConnectData>* queue = N_Initializer::m_pConnectQueue;
+  Q_DLList<N_Socket::ConnectData>* queue = Runtime::connects();
   for (N_Socket::ConnectData* entry = queue != nullptr ? queue->getFirst() : nullptr; entry != nullptr;
        entry = queue->getNext(entry)) {
     if (entry != data || entry->pListener != this) continue;
@@ -106,7 +103,7 @@ bool N_Listener::rejectConnect(N_Socket::ConnectData* data) {
       N_Socket::chkErr(platform::closesocket(entry->socket));
     queue->remove(entry);
     // The listener may have stopped accepting at a full queue.
-    N_Initializer::releaseThreadLoop();
+    Runtime::wake();
     return true;
   }
   return false;

@@ -10,6 +10,7 @@
 #include "N_Initializer.h"
 #include "Q_New.h"
 #include "Q_Throw.h"
+#include "Runtime.h"
 #include "RuntimeLock.h"
 #include "socket_options.h"
 #include "win32.h"
@@ -102,11 +103,8 @@ void N_Socket::construct(ConnectData* data) {
     chkErr(platform::getsockname(m_socket, reinterpret_cast<platform::sockaddr*>(&m_localAddress), &length));
     // Register before the entry goes, so that a failed registration leaves
     // the entry queued (its socket closed by the clean-up below).
-    N_Socket** slot = N_Initializer::m_pSockets->append();
-    *slot = this;
-    m_pRegistryEntry = slot;
-    N_Initializer::m_pConnectQueue->remove(data);
-    N_Initializer::releaseThreadLoop();
+    m_pRegistryEntry = Runtime::enroll(Runtime::sockets(), this);
+    Runtime::connects()->remove(data);
   } catch (...) {
     lock.unlock();
     destruct();
@@ -117,15 +115,15 @@ void N_Socket::construct(ConnectData* data) {
 void N_Socket::construct(const N_Address* address, int port, SocketType type) {
   destruct();
   RuntimeLock lock;
-  N_Initializer::releaseThreadLoop();
+  Runtime::wake();
   try {
     baseConstructor();
     m_pAddress = address;
     m_iPort = port;
     m_socketType = type;
-    platform::WSAPROTOCOL_INFOA* provider = N_Initializer::m_tcpProtocol;
+    platform::WSAPROTOCOL_INFOA* provider = Runtime::provider(true);
     if (type == SOCKET_UDP) {
-      provider = N_Initializer::m_udpProtocol;
+      provider = Runtime::provider(false);
       m_bConnected = true;
       m_bPackage = false;
     }
@@ -160,10 +158,7 @@ void N_Socket::construct(const N_Address* address, int port, SocketType type) {
       Q_Throw<N_NetException_LocalAddressAlreadyInUse>();
     length = sizeof m_localAddress;
     chkErr(platform::getsockname(m_socket, reinterpret_cast<platform::sockaddr*>(&m_localAddress), &length));
-    N_Socket** slot = N_Initializer::m_pSockets->append();
-    *slot = this;
-    m_pRegistryEntry = slot;
-    N_Initializer::releaseThreadLoop();
+    m_pRegistryEntry = Runtime::enroll(Runtime::sockets(), this);
   } catch (...) {
     lock.unlock();
     destruct();
@@ -174,24 +169,12 @@ void N_Socket::construct(const N_Address* address, int port, SocketType type) {
 void N_Socket::destruct() {
   if (!m_bConstructed) return;
   RuntimeLock lock;
-  N_Initializer::releaseThreadLoop();
+  Runtime::wake();
   awaitDelivery();
   chkErr(platform::WSAEventSelect(m_socket, m_event, 0));
   platform::WSACloseEvent(m_event);
   if (m_socket != 0) chkErr(platform::closesocket(m_socket));
-  // Entries in flight become orphans: Winsock may still name their
-  // overlapped, so only the network side may free them.
-  for (auto* queue : {N_Initializer::m_pInProcessQueue, N_Initializer::m_pOutProcessQueue}) {
-    if (queue == nullptr) continue;
-    for (DataQueue* entry = queue->getFirst(); entry != nullptr; entry = queue->getNext(entry)) {
-      if (entry->pSocket == this) {
-        entry->bLive = false;
-        entry->pSocket = nullptr;
-      }
-    }
-  }
-  // Orphans may now stand anywhere in the send queue: the pump looks at all.
-  if (N_Initializer::m_pOutProcessQueue != nullptr) N_Initializer::m_pPumpFrom = N_Initializer::m_pOutProcessQueue->getFirst();
+  Runtime::orphan(this);
   if (m_pReceiveQueue != nullptr) {
     for (DataQueue* entry = m_pReceiveQueue->getFirst(); entry != nullptr; entry = m_pReceiveQueue->getNext(entry))
       Q_DeleteArray(entry->pBuffer);
@@ -202,9 +185,7 @@ void N_Socket::destruct() {
   m_pPacketBuffer = nullptr;
   if (m_bOwnsAddress && m_pAddress != nullptr) Q_Delete(const_cast<N_Address*>(m_pAddress));
   m_pAddress = nullptr;
-  if (m_pRegistryEntry != nullptr && N_Initializer::m_pSockets != nullptr)
-    N_Initializer::m_pSockets->remove(m_pRegistryEntry);
-  m_pRegistryEntry = nullptr;
+  if (m_pRegistryEntry != nullptr) Runtime::withdraw(Runtime::sockets(), m_pRegistryEntry);
   initializeMembers();
 }
 
@@ -249,8 +230,7 @@ bool N_Socket::poll(void*& data, unsigned int& size) {
   if (m_bReadPaused && receiveBacklogCost() < N_Initializer::getLimits().uReceiveBacklog) {
     m_bReadPaused = false;
     m_bReadResume = true;
-    N_Initializer::m_bReadsToResume = true;
-    N_Initializer::releaseThreadLoop();
+    Runtime::resumeReads();
   }
   return found;
 }
@@ -281,7 +261,7 @@ int N_Socket::getReceivePacketBytesMissing() const {
 
 int N_Socket::getBytesWaitingForSend() const {
   RuntimeLock lock;
-  return static_cast<int>(N_Initializer::m_uBytesWaitingForSend);
+  return static_cast<int>(Runtime::bytesWaitingForSend());
 }
 
 unsigned int N_Socket::getQueuedSendBytes() const {
@@ -309,17 +289,17 @@ unsigned int N_Socket::getQueuedReceiveBytes() const {
 }
 
 N_Socket** N_Socket::getFirstSocket() {
-  return N_Initializer::m_pSockets != nullptr ? N_Initializer::m_pSockets->getFirst() : nullptr;
+  return Runtime::sockets() != nullptr ? Runtime::sockets()->getFirst() : nullptr;
 }
 
 N_Socket** N_Socket::getNextSocket(N_Socket** socket) {
-  return N_Initializer::m_pSockets != nullptr ? N_Initializer::m_pSockets->getNext(socket) : nullptr;
+  return Runtime::sockets() != nullptr ? Runtime::sockets()->getNext(socket) : nullptr;
 }
 
 bool N_Socket::pollEvent(const N_Socket*& socket, bool connected) {
-  if (N_Initializer::m_pSockets == nullptr) return false;
+  if (Runtime::sockets() == nullptr) return false;
   RuntimeLock lock;
-  Q_DLList<N_Socket*>* sockets = N_Initializer::m_pSockets;
+  Q_DLList<N_Socket*>* sockets = Runtime::sockets();
   for (N_Socket** slot = sockets->getFirst(); slot != nullptr; slot = sockets->getNext(slot)) {
     N_Socket* candidate = *slot;
     if (candidate == nullptr || !candidate->m_bEventPending || candidate->m_bConnected != connected) continue;
@@ -334,7 +314,7 @@ bool N_Socket::pollConnect(const N_Socket*& socket) { return pollEvent(socket, t
 
 bool N_Socket::pollDisconnect(const N_Socket*& socket) { return pollEvent(socket, false); }
 
-bool N_Socket::networkPresent() { return N_Initializer::m_uInstance > 0; }
+bool N_Socket::networkPresent() { return Runtime::present(); }
 
 float N_Socket::ping(N_Address*) { return FLT_MAX; }
 

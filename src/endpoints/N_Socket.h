@@ -254,8 +254,6 @@ class VARDEL_API N_Socket {
                            platform::OVERLAPPED* lpOverlapped, platform::DWORD dwFlags);
 
   static bool pollEvent(const N_Socket*& socket, bool connected);
-  // Send path: takes back the entries from `first` to the queue's tail.
-  static void dropSendEntriesFrom(DataQueue* first);
 
   // Receive path, on the network thread with the runtime's mutex held. The
   // bool results are false when the socket was destroyed during a receive()

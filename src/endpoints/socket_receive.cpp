@@ -23,6 +23,7 @@
 #include "data_queue.h"
 #include "trace.h"
 #include "little_endian.h"
+#include "Runtime.h"
 #include "RuntimeLock.h"
 #include "win32.h"
 #include "winsock.h"
@@ -42,7 +43,7 @@ thread_local bool tl_bInReceive = false;
 }  // namespace
 
 void N_Socket::postRead() {
-  Q_DLList<DataQueue>* queue = N_Initializer::m_pInProcessQueue;
+  Q_DLList<DataQueue>* queue = Runtime::reads();
   DataQueue* entry = nullptr;
   try {
     entry = appendEntry(queue, this, true, false);
@@ -63,7 +64,7 @@ void N_Socket::postRead() {
   entry->overlapped.hEvent = entry;
   platform::DWORD received = 0;
   platform::DWORD flags = 0;
-  if (WSARecv(m_socket, &entry->wsaBuf, 1, &received, &flags, &entry->overlapped, N_Initializer::receiveComplete) ==
+  if (WSARecv(m_socket, &entry->wsaBuf, 1, &received, &flags, &entry->overlapped, Runtime::readComplete) ==
       platform::SOCKET_ERROR) {
     int error = platform::WSAGetLastError();
     // WSAEWOULDBLOCK counts as under way, like WSA_IO_PENDING.
@@ -136,7 +137,7 @@ void N_Socket::awaitDelivery() {
     }
     // The network thread may have gone back to its wait meanwhile, on this
     // socket's event too: it must leave it before the event is closed.
-    N_Initializer::releaseThreadLoop();
+    Runtime::wake();
   }
 }
 
@@ -351,7 +352,7 @@ void N_Initializer::receiveComplete(platform::DWORD error, platform::DWORD bytes
 void N_Socket::injectRead(N_Socket* socket, const void* bytes, unsigned int size, platform::DWORD error) {
   size = std::min(size, kReadSize);
   RuntimeLock lock;
-  Q_DLList<DataQueue>* queue = N_Initializer::m_pInProcessQueue;
+  Q_DLList<DataQueue>* queue = Runtime::reads();
   DataQueue* entry = nullptr;
   try {
     entry = appendEntry(queue, socket, true, false);
@@ -365,5 +366,5 @@ void N_Socket::injectRead(N_Socket* socket, const void* bytes, unsigned int size
   entry->overlapped.hEvent = entry;
   if (size > 0) std::memcpy(entry->pBuffer, bytes, size);
   lock.unlock();
-  N_Initializer::receiveComplete(error, error == 0 ? size : 0, &entry->overlapped, 0);
+  Runtime::readComplete(error, error == 0 ? size : 0, &entry->overlapped, 0);
 }

@@ -12,7 +12,7 @@
 #include "Q_System.h"
 #include "little_endian.h"
 #include "Q_Throw.h"
-#include "data_queue.h"
+#include "Runtime.h"
 #include "RuntimeLock.h"
 #include "win32.h"
 #include "winsock.h"
@@ -24,16 +24,6 @@ namespace {
 constexpr unsigned int kChunkReserve = 16;
 
 }  // namespace
-
-void N_Socket::dropSendEntriesFrom(DataQueue* first) {
-  Q_DLList<DataQueue>* queue = N_Initializer::m_pOutProcessQueue;
-  while (first != nullptr) {
-    DataQueue* next = queue->getNext(first);
-    Q_DeleteArray(first->pBuffer);
-    queue->remove(first);
-    first = next;
-  }
-}
 
 void N_Socket::send(void* data, unsigned int size) {
   const char* bytes = static_cast<const char*>(data);
@@ -76,12 +66,11 @@ void N_Socket::send(void* data, unsigned int size) {
   }
 
   RuntimeLock lock;
-  Q_DLList<DataQueue>* queue = N_Initializer::m_pOutProcessQueue;
   DataQueue* first = nullptr;
   std::size_t appended = 0;
   try {
     for (const Chunk& c : chunks) {
-      DataQueue* entry = appendEntry(queue, this, false, false);
+      DataQueue* entry = Runtime::appendSend(this);
       entry->pBuffer = c.buffer;
       entry->wsaBuf.buf = c.buffer;
       entry->wsaBuf.len = c.length;
@@ -90,17 +79,15 @@ void N_Socket::send(void* data, unsigned int size) {
     }
   } catch (...) {
     // Nothing of a message that failed stays queued.
-    dropSendEntriesFrom(first);
+    Runtime::dropSends(first);
     for (std::size_t i = appended; i < chunks.size(); ++i) Q_DeleteArray(chunks[i].buffer);
     throw;
   }
-  for (const Chunk& c : chunks) {
-    N_Initializer::m_uBytesWaitingForSend += c.length;
-    m_uQueuedSendBytes += c.length;
-  }
+  unsigned int queued = 0;
+  for (const Chunk& c : chunks) queued += c.length;
+  m_uQueuedSendBytes += queued;
   m_uQueuedSendMessages += static_cast<unsigned int>(chunks.size());
-  if (N_Initializer::m_pPumpFrom == nullptr) N_Initializer::m_pPumpFrom = first;
-  N_Initializer::releaseThreadLoop();
+  Runtime::sendsQueued(first, queued);
 }
 
 void N_Socket::sendComplete(platform::DWORD dwError, platform::DWORD cbTransferred, platform::OVERLAPPED* lpOverlapped,
@@ -129,11 +116,9 @@ void N_Socket::sendComplete(platform::DWORD dwError, platform::DWORD cbTransferr
     socket->m_bWritable = true;
     socket->m_bWriteCompletionPending = false;
   }
-  N_Initializer::m_uBytesWaitingForSend -= entry->wsaBuf.len;
   if (socket != nullptr) {
     socket->m_uQueuedSendBytes -= entry->wsaBuf.len;
     --socket->m_uQueuedSendMessages;
   }
-  if (N_Initializer::m_pPumpFrom == entry) N_Initializer::m_pPumpFrom = N_Initializer::m_pOutProcessQueue->getNext(entry);
-  N_Initializer::m_pOutProcessQueue->remove(entry);
+  Runtime::sendDone(entry);
 }

@@ -78,6 +78,7 @@ Q_DLList<N_Socket::DataQueue>* N_Initializer::m_pInProcessQueue = nullptr;
 Q_DLList<N_Socket::DataQueue>* N_Initializer::m_pOutProcessQueue = nullptr;
 N_Socket::DataQueue* N_Initializer::m_pPumpFrom = nullptr;
 unsigned int N_Initializer::m_uBytesWaitingForSend = 0;
+unsigned int N_Initializer::m_uPumpPass = 0;
 bool N_Initializer::m_bReadsToResume = false;
 
 N_Initializer::N_Initializer() : m_wsaData{} {

@@ -104,13 +104,7 @@ class VARDEL_API N_Initializer {
   static N_Limits getLimits();
 
  private:
-  friend class N_Address;
-  friend class N_Socket;
-  friend class N_Listener;
-  friend class N_Client;
-  friend class N_Server;
-  friend class RuntimeLock;
-  friend class RuntimeUnlock;
+  friend class Runtime;  // the owner of the shared state below
 
   void start();
   static void stop();
@@ -167,12 +161,10 @@ class VARDEL_API N_Initializer {
   static Q_DLList<N_Socket::ConnectData>* m_pConnectQueue;
   static Q_DLList<N_Socket::DataQueue>* m_pInProcessQueue;
   static Q_DLList<N_Socket::DataQueue>* m_pOutProcessQueue;
-  // Kept beside the out queue so that neither the pump nor the byte count
-  // walks the whole backlog: every entry before m_pPumpFrom is issued and
-  // live (null: no entry needs the pump), and m_uBytesWaitingForSend is the
-  // sum of wsaBuf.len over the queue. Both change under m_hMutex only.
+  // Facts kept beside the out queue (see send_queue.cpp).
   static N_Socket::DataQueue* m_pPumpFrom;
   static unsigned int m_uBytesWaitingForSend;
+  static unsigned int m_uPumpPass;
   // Set (under m_hMutex) when a paused socket may read again; the next pass
   // walks the sockets for it.
   static bool m_bReadsToResume;

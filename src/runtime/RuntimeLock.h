@@ -4,7 +4,7 @@
 // code, or to let the network thread finish a delivery).
 #pragma once
 
-#include "N_Initializer.h"
+#include "Runtime.h"
 #include "win32.h"
 
 class MutexHold {
@@ -33,14 +33,14 @@ class MutexHold {
 // The runtime's mutex, which guards its registries and queues.
 class RuntimeLock : public MutexHold {
  public:
-  RuntimeLock() : MutexHold(N_Initializer::m_hMutex) {}
+  RuntimeLock() : MutexHold(Runtime::mutex()) {}
 };
 
 // Steps out of the runtime's mutex that the caller holds, for a scope.
 class RuntimeUnlock {
  public:
-  RuntimeUnlock() { platform::ReleaseMutex(N_Initializer::m_hMutex); }
-  ~RuntimeUnlock() { platform::WaitForSingleObject(N_Initializer::m_hMutex, platform::INFINITE); }
+  RuntimeUnlock() { platform::ReleaseMutex(Runtime::mutex()); }
+  ~RuntimeUnlock() { platform::WaitForSingleObject(Runtime::mutex(), platform::INFINITE); }
   RuntimeUnlock(const RuntimeUnlock&) = delete;
   RuntimeUnlock& operator=(const RuntimeUnlock&) = delete;
 };

@@ -1,13 +1,13 @@
 // The parts of the network thread's pass that deal with sockets and
-// listeners: the wait set, the send pump and the service of one signalled
-// event. All of it runs on the network thread with m_hMutex held.
+// listeners: the wait set and the service of one signalled event (the send
+// pump is with the rest of the send queue, in send_queue.cpp). All of it
+// runs on the network thread with m_hMutex held.
 #include <cstring>
 
 #include "N_Exceptions.h"
 #include "N_Initializer.h"
 #include "N_Listener.h"
 #include "N_Socket.h"
-#include "Q_New.h"
 #include "trace.h"
 #include "win32.h"
 #include "winsock.h"
@@ -64,61 +64,6 @@ void N_Initializer::resumeReads() {
     socket->m_bReadResume = false;
     socket->postRead();
   }
-}
-
-void N_Initializer::pumpSends() {
-  // Numbers the passes so that a socket can be held for the rest of one
-  // without a walk to clear the marks (0 is never a pass number).
-  static unsigned int pass = 0;
-  if (++pass == 0) pass = 1;
-  Q_DLList<N_Socket::DataQueue>* queue = m_pOutProcessQueue;
-  // Entries before m_pPumpFrom are issued and live: only their completions
-  // can change them, so the walk starts behind them.
-  N_Socket::DataQueue* entry = m_pPumpFrom;
-  N_Socket::DataQueue* firstUnsettled = nullptr;
-  while (entry != nullptr) {
-    N_Socket::DataQueue* next = queue->getNext(entry);
-    N_Socket* socket = entry->pSocket;
-    if (socket == nullptr) {
-      // An orphan. One whose WSASend is still out stays until its
-      // completion: Winsock names its overlapped until then. One whose
-      // completion failed is marked complete and can go.
-      if (!entry->bIssued || entry->bComplete) {
-        m_uBytesWaitingForSend -= entry->wsaBuf.len;
-        Q_DeleteArray(entry->pBuffer);
-        entry->pBuffer = nullptr;
-        entry->wsaBuf.buf = nullptr;
-        queue->remove(entry);
-        entry = nullptr;
-      }
-    } else if (!entry->bIssued && socket->m_bWritable && socket->m_uPumpHeldPass != pass) {
-      entry->overlapped.hEvent = entry;
-      platform::DWORD sent = 0;
-      if (WSASend(socket->m_socket, &entry->wsaBuf, 1, &sent, 0, &entry->overlapped, N_Socket::sendComplete) == 0) {
-        entry->bIssued = true;
-      } else {
-        int error = platform::WSAGetLastError();
-        if (error == platform::WSAEWOULDBLOCK) {
-          // This and every later entry of the socket wait for FD_WRITE.
-          socket->m_bWritable = false;
-          entry->overlapped.hEvent = nullptr;
-        } else if (error == platform::WSA_IO_PENDING) {
-          // Later entries wait for this one's completion.
-          entry->bIssued = true;
-          socket->m_bWritable = false;
-          socket->m_bWriteCompletionPending = true;
-        } else {
-          // Tried again on a later pass. The socket's later entries must not
-          // overtake it, so they wait too.
-          socket->m_uPumpHeldPass = pass;
-        }
-      }
-    }
-    if (entry != nullptr && firstUnsettled == nullptr && (!entry->bIssued || entry->pSocket == nullptr))
-      firstUnsettled = entry;
-    entry = next;
-  }
-  m_pPumpFrom = firstUnsettled;
 }
 
 void N_Initializer::serveEvent(platform::WSAEVENT handle) {

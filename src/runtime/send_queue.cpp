@@ -1,0 +1,112 @@
+// The send queue: what send() appends, what the network thread's pump
+// issues, and what completions and destroyed sockets take out. Every rule
+// about the queue's order, its byte count and where the pump starts is
+// here. All of it runs with the runtime's mutex held.
+#include "N_Initializer.h"
+#include "N_Socket.h"
+#include "Q_New.h"
+#include "Runtime.h"
+#include "data_queue.h"
+#include "win32.h"
+#include "winsock.h"
+
+// The queue keeps two facts beside its entries, so that neither the pump nor
+// the byte count walks the whole backlog: every entry before m_pPumpFrom is
+// issued and live (null: no entry needs the pump), and m_uBytesWaitingForSend
+// is the sum of wsaBuf.len over the queue.
+
+N_Socket::DataQueue* Runtime::appendSend(N_Socket* socket) {
+  return appendEntry(N_Initializer::m_pOutProcessQueue, socket, false, false);
+}
+
+void Runtime::dropSends(N_Socket::DataQueue* first) {
+  Q_DLList<N_Socket::DataQueue>* queue = N_Initializer::m_pOutProcessQueue;
+  while (first != nullptr) {
+    N_Socket::DataQueue* next = queue->getNext(first);
+    Q_DeleteArray(first->pBuffer);
+    queue->remove(first);
+    first = next;
+  }
+}
+
+void Runtime::sendsQueued(N_Socket::DataQueue* first, unsigned bytes) {
+  N_Initializer::m_uBytesWaitingForSend += bytes;
+  if (N_Initializer::m_pPumpFrom == nullptr) N_Initializer::m_pPumpFrom = first;
+  wake();
+}
+
+void Runtime::sendDone(N_Socket::DataQueue* entry) {
+  N_Initializer::m_uBytesWaitingForSend -= entry->wsaBuf.len;
+  if (N_Initializer::m_pPumpFrom == entry) N_Initializer::m_pPumpFrom = N_Initializer::m_pOutProcessQueue->getNext(entry);
+  N_Initializer::m_pOutProcessQueue->remove(entry);
+}
+
+void Runtime::orphan(const N_Socket* socket) {
+  for (auto* queue : {N_Initializer::m_pInProcessQueue, N_Initializer::m_pOutProcessQueue}) {
+    if (queue == nullptr) continue;
+    for (N_Socket::DataQueue* entry = queue->getFirst(); entry != nullptr; entry = queue->getNext(entry)) {
+      if (entry->pSocket == socket) {
+        entry->bLive = false;
+        entry->pSocket = nullptr;
+      }
+    }
+  }
+  // Orphans may now stand anywhere in the send queue: the pump looks at all.
+  if (N_Initializer::m_pOutProcessQueue != nullptr)
+    N_Initializer::m_pPumpFrom = N_Initializer::m_pOutProcessQueue->getFirst();
+}
+
+void N_Initializer::pumpSends() {
+  // Numbers the pumps so that a socket can be held for the rest of one
+  // without a walk to clear the marks (0 is never a pump's number).
+  if (++m_uPumpPass == 0) m_uPumpPass = 1;
+  const unsigned int pass = m_uPumpPass;
+  Q_DLList<N_Socket::DataQueue>* queue = m_pOutProcessQueue;
+  // Entries before m_pPumpFrom are issued and live: only their completions
+  // can change them, so the walk starts behind them.
+  N_Socket::DataQueue* entry = m_pPumpFrom;
+  N_Socket::DataQueue* firstUnsettled = nullptr;
+  while (entry != nullptr) {
+    N_Socket::DataQueue* next = queue->getNext(entry);
+    N_Socket* socket = entry->pSocket;
+    if (socket == nullptr) {
+      // An orphan. One whose WSASend is still out stays until its
+      // completion: Winsock names its overlapped until then. One whose
+      // completion failed is marked complete and can go.
+      if (!entry->bIssued || entry->bComplete) {
+        m_uBytesWaitingForSend -= entry->wsaBuf.len;
+        Q_DeleteArray(entry->pBuffer);
+        entry->pBuffer = nullptr;
+        entry->wsaBuf.buf = nullptr;
+        queue->remove(entry);
+        entry = nullptr;
+      }
+    } else if (!entry->bIssued && socket->m_bWritable && socket->m_uPumpHeldPass != pass) {
+      entry->overlapped.hEvent = entry;
+      platform::DWORD sent = 0;
+      if (WSASend(socket->m_socket, &entry->wsaBuf, 1, &sent, 0, &entry->overlapped, N_Socket::sendComplete) == 0) {
+        entry->bIssued = true;
+      } else {
+        int error = platform::WSAGetLastError();
+        if (error == platform::WSAEWOULDBLOCK) {
+          // This and every later entry of the socket wait for FD_WRITE.
+          socket->m_bWritable = false;
+          entry->overlapped.hEvent = nullptr;
+        } else if (error == platform::WSA_IO_PENDING) {
+          // Later entries wait for this one's completion.
+          entry->bIssued = true;
+          socket->m_bWritable = false;
+          socket->m_bWriteCompletionPending = true;
+        } else {
+          // Tried again on a later pass. The socket's later entries must not
+          // overtake it, so they wait too.
+          socket->m_uPumpHeldPass = pass;
+        }
+      }
+    }
+    if (entry != nullptr && firstUnsettled == nullptr && (!entry->bIssued || entry->pSocket == nullptr))
+      firstUnsettled = entry;
+    entry = next;
+  }
+  m_pPumpFrom = firstUnsettled;
+}
