@@ -23,6 +23,16 @@ struct HostRecord {
   char* aliases[1];
   char* addressList[17];
   std::uint32_t addresses[16];
+
+  // The entry, pointing into this record, once name and addresses are in.
+  hostent* finish() {
+    entry.h_name = name;
+    entry.h_aliases = aliases;
+    entry.h_addrtype = wsa::afInet;
+    entry.h_length = 4;
+    entry.h_addr_list = addressList;
+    return &entry;
+  }
 };
 
 HostRecord& threadRecord() {
@@ -96,12 +106,7 @@ hostent* gethostbyname(const char* name) {
     ++count;
   }
   ::freeaddrinfo(list);
-  record.entry.h_name = record.name;
-  record.entry.h_aliases = record.aliases;
-  record.entry.h_addrtype = wsa::afInet;
-  record.entry.h_length = 4;
-  record.entry.h_addr_list = record.addressList;
-  return &record.entry;
+  return record.finish();
 }
 
 hostent* gethostbyaddr(const char* addr, int len, int type) {
@@ -127,12 +132,7 @@ hostent* gethostbyaddr(const char* addr, int len, int type) {
   }
   record.addresses[0] = address.sin_addr.s_addr;
   record.addressList[0] = reinterpret_cast<char*>(&record.addresses[0]);
-  record.entry.h_name = record.name;
-  record.entry.h_aliases = record.aliases;
-  record.entry.h_addrtype = wsa::afInet;
-  record.entry.h_length = 4;
-  record.entry.h_addr_list = record.addressList;
-  return &record.entry;
+  return record.finish();
 }
 
 }  // namespace platform
