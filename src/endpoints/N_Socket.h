@@ -60,6 +60,7 @@
 
 #include <atomic>
 #include <cstdint>
+#include <thread>
 
 #include "Q_DLList.h"
 #include "vardel_export.h"
@@ -303,10 +304,11 @@ class VARDEL_API N_Socket {
   // A nonsense length or a failed allocation broke the package stream; the
   // rest of its packaged reads is dropped.
   bool m_bStreamBroken;
-  // The message entry whose receive() call runs now, with the mutex released;
-  // null otherwise. destruct() on another thread waits while it is set, and
-  // poll() leaves that entry in place.
+  // The message entry whose receive() call runs now, with the mutex released,
+  // and the thread that runs it; null otherwise. destruct() on another thread
+  // waits while it is set, and poll() leaves that entry in place.
   DataQueue* m_pDelivering;
+  std::thread::id m_deliveringThread;
   // The send pump's pass in which a WSASend of this socket failed for a
   // reason it retries later; the socket's later entries wait for that retry,
   // so that the stream keeps its order.

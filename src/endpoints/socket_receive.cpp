@@ -14,6 +14,7 @@
 #include <atomic>
 #include <cstdint>
 #include <cstring>
+#include <thread>
 
 #include "N_Exceptions.h"
 #include "N_Initializer.h"
@@ -36,9 +37,6 @@ constexpr int kPrefixSlack = 1024;
 // read buffer rather than keeping all of it, and the block of a long message
 // starts at this size and doubles as the bytes arrive.
 constexpr unsigned int kCompactBelow = 16384;
-
-// True on the network thread while it runs a receive() override.
-thread_local bool tl_bInReceive = false;
 
 }  // namespace
 
@@ -103,17 +101,16 @@ N_Socket::DataQueue* N_Socket::appendMessage(char* buffer, char* data, unsigned 
 
 bool N_Socket::deliver(DataQueue* read, DataQueue* message) {
   m_pDelivering = message;
+  m_deliveringThread = std::this_thread::get_id();
   bool keep = true;
   {
     RuntimeUnlock stepOut;
-    tl_bInReceive = true;
     try {
       keep = receive(message->wsaBuf.buf, message->wsaBuf.len);
     } catch (...) {
       traceSwallowed("receive");
       keep = true;
     }
-    tl_bInReceive = false;
   }
   // Only the override itself can have destroyed the socket meanwhile; then
   // the socket, this message and maybe the read buffer are gone.
@@ -130,7 +127,8 @@ bool N_Socket::deliver(DataQueue* read, DataQueue* message) {
 }
 
 void N_Socket::awaitDelivery() {
-  while (m_pDelivering != nullptr && !tl_bInReceive) {
+  // The override itself may destroy its socket: it must not wait for itself.
+  while (m_pDelivering != nullptr && m_deliveringThread != std::this_thread::get_id()) {
     {
       RuntimeUnlock stepOut;
       platform::Sleep(1);
