@@ -1,6 +1,7 @@
 // The parts of the network thread's pass that deal with sockets and
 // listeners: the wait set, the send pump and the service of one signalled
 // event. All of it runs on the network thread with m_hMutex held.
+#include <cstdint>
 #include <cstring>
 
 #include "N_Exceptions.h"
@@ -67,10 +68,10 @@ void N_Initializer::resumeReads() {
 }
 
 void N_Initializer::pumpSends() {
-  // Numbers the passes so that a socket can be held for the rest of one
-  // without a walk to clear the marks (0 is never a pass number).
-  static unsigned int pass = 0;
-  if (++pass == 0) pass = 1;
+  // Numbers the passes, for the statistics and so that a socket can be held
+  // for the rest of one without a walk to clear the marks (64 bits never
+  // wrap back to 0, which is no pass).
+  const std::uint64_t pass = ++m_uNetworkPasses;
   Q_DLList<N_Socket::DataQueue>* queue = m_pOutProcessQueue;
   // Entries before m_pPumpFrom are issued and live: only their completions
   // can change them, so the walk starts behind them.
@@ -137,6 +138,7 @@ void N_Initializer::serveEvent(platform::WSAEVENT handle) {
       break;
     }
   }
+  if (socket != nullptr || listener != nullptr) ++m_uEventsServed;
 
   if (socket != nullptr) {
     // Zeroed first: a failed enumeration must not serve an old record again.
