@@ -22,6 +22,7 @@ struct Options {
   std::string simulateOn = "clients";  // world: clients | server | both
   bool simulateHere = true;          // this process applies the settings above
   std::string csv;                   // client: latency of every message read, to this file
+  std::string json;                  // server and world: statistics per client and second, to this file
   bool verbose = false;
 };
 

@@ -2,7 +2,7 @@
 //
 //   vardel_demo                       shared world: a server and 4 client processes on loopback
 //   vardel_demo world   [--clients N] [--seconds S] [--loss F] [--delay MIN:MAX]
-//                       [--model K=V,...] [--simulate-on clients|server|both] [--csv FILE]
+//                       [--model K=V,...] [--simulate-on clients|server|both] [--csv FILE] [--json FILE]
 //   vardel_demo server  [--port P] [--seconds S]        run the server by hand
 //   vardel_demo client  SERVER [--host ADDR] [--port P] run one client by hand
 //   vardel_demo transport [listen | connect HOST]       two processes, messages over TCP and UDP
@@ -28,7 +28,9 @@ void usage() {
       "               the network model: a delay per message, no limit on the rate (see the README)\n"
       "       --simulate-on clients|server|both  where the world applies --loss, --delay and --model\n"
       "               (default clients: the server stays a healthy one)\n"
-      "       --csv FILE  client: every position read as \"seconds,latency_ms\"; world: of the first client\n");
+      "       --csv FILE  client: every position read as \"seconds,latency_ms\"; world: of the first client\n"
+      "       --json FILE  world and server: one JSON object per client and second, from the connection's\n"
+      "               statistics (scripts/plot_stats.py draws them)\n");
 }
 
 }  // namespace
@@ -75,6 +77,8 @@ int main(int argc, char** argv) {
       }
     } else if (a == "--csv") {
       options.csv = value();
+    } else if (a == "--json") {
+      options.json = value();
     } else if (a == "-v") {
       options.verbose = true;
     } else if (a == "-h" || a == "--help") {

@@ -133,6 +133,45 @@ void forEachRecord(const void* data, unsigned size, Each each) {
   }
 }
 
+// Per-second rates of one connection from two copies of its statistics, as
+// the server's end counts: in = read from the client, out = sent to it.
+struct Rates {
+  double bytesIn[3] = {}, bytesOut[3] = {}, messagesIn[3] = {}, messagesOut[3] = {};
+  double replaced = 0, lost = 0, delayed = 0;
+};
+
+const char* const kChannelNames[3] = {"reliable", "unreliable", "control"};
+
+const N_SocketStats& channelOf(const N_ClientStats& s, int c) {
+  return c == 0 ? s.reliable : c == 1 ? s.unreliable : s.control;
+}
+
+Rates ratesBetween(const N_ClientStats& before, const N_ClientStats& now, double seconds) {
+  Rates r;
+  if (seconds <= 0) return r;
+  auto rate = [seconds](std::uint64_t a, std::uint64_t b) { return static_cast<double>(b - a) / seconds; };
+  for (int c = 0; c < 3; ++c) {
+    const N_SocketStats &a = channelOf(before, c), &b = channelOf(now, c);
+    r.bytesIn[c] = rate(a.uBytesReceived, b.uBytesReceived);
+    r.bytesOut[c] = rate(a.uBytesSent, b.uBytesSent);
+    r.messagesIn[c] = rate(a.uMessagesReceived, b.uMessagesReceived);
+    r.messagesOut[c] = rate(a.uMessagesSent, b.uMessagesSent);
+  }
+  r.replaced = rate(before.reliableQueue.uPayloadsReplaced + before.unreliableQueue.uPayloadsReplaced,
+                    now.reliableQueue.uPayloadsReplaced + now.unreliableQueue.uPayloadsReplaced);
+  r.lost = rate(before.uSimulatedLost + before.model.uLost, now.uSimulatedLost + now.model.uLost);
+  r.delayed = rate(before.uSimulatedDelayed + before.model.uDelayed, now.uSimulatedDelayed + now.model.uDelayed);
+  return r;
+}
+
+// A number for JSON: NaN (nothing measured) is null.
+std::string jsonNumber(double value, int decimals) {
+  if (!std::isfinite(value)) return "null";
+  char text[40];
+  std::snprintf(text, sizeof text, "%.*f", decimals, value);
+  return text;
+}
+
 struct ClientRow {
   std::string name;
   unsigned entity = 0;
@@ -145,9 +184,54 @@ struct ClientRow {
   unsigned sentDown = 0;  // unreliable batches sent to the client
   Achieved up;            // client to server, as read here
   double downMs = NAN, downLoss = -1;  // server to client, as the client reported
+  N_ClientStats stats;    // the connection's statistics at the last full second
+  Clock::time_point statsAt;
+  Rates rates;            // over the last full second
 };
 
-void drawTable(N_Server& server, std::map<N_Client*, ClientRow>& rows, const Options& o, int& lines) {
+// One line of JSON for one client and second (--json).
+void writeJson(std::FILE* out, double t, const ClientRow& row) {
+  const N_ClientStats& s = row.stats;
+  const Rates& r = row.rates;
+  std::string line = "{\"t\":" + jsonNumber(t, 3) + ",\"client\":\"" + row.name + "\",\"entity\":" +
+                     std::to_string(row.entity);
+  line += ",\"rtt_ms\":{\"latest\":" + jsonNumber(s.fLatency * 1000.0, 3) +
+          ",\"lowest\":" + jsonNumber(s.fLatencyLowest * 1000.0, 3) + ",\"mean\":" + jsonNumber(s.fLatencyMean * 1000.0, 3) +
+          ",\"highest\":" + jsonNumber(s.fLatencyHighest * 1000.0, 3) + ",\"heartbeats\":" + std::to_string(s.uHeartbeats) + "}";
+  line += ",\"grant_Bps\":" + std::to_string(s.uBandwidth);
+  line += ",\"per_second\":{";
+  for (int c = 0; c < 3; ++c) {
+    line += std::string(c > 0 ? "," : "") + "\"" + kChannelNames[c] + "\":{\"bytes_in\":" + jsonNumber(r.bytesIn[c], 1) +
+            ",\"bytes_out\":" + jsonNumber(r.bytesOut[c], 1) + ",\"messages_in\":" + jsonNumber(r.messagesIn[c], 1) +
+            ",\"messages_out\":" + jsonNumber(r.messagesOut[c], 1) + "}";
+  }
+  line += ",\"payloads_replaced\":" + jsonNumber(r.replaced, 1) + ",\"simulated_lost\":" + jsonNumber(r.lost, 1) +
+          ",\"simulated_delayed\":" + jsonNumber(r.delayed, 1) + "}";
+  const unsigned sendWaiting =
+      s.reliable.uBytesWaitingForSend + s.unreliable.uBytesWaitingForSend + s.control.uBytesWaitingForSend;
+  line += ",\"waiting_bytes\":{\"reliable_queue\":" + std::to_string(s.reliableQueue.uBytesWaiting) +
+          ",\"unreliable_queue\":" + std::to_string(s.unreliableQueue.uBytesWaiting) +
+          ",\"sockets\":" + std::to_string(sendWaiting) + "}";
+  line += ",\"totals\":{\"bytes_in\":" +
+          std::to_string(s.reliable.uBytesReceived + s.unreliable.uBytesReceived + s.control.uBytesReceived) +
+          ",\"bytes_out\":" + std::to_string(s.reliable.uBytesSent + s.unreliable.uBytesSent + s.control.uBytesSent) +
+          ",\"payloads_refused\":" +
+          std::to_string(s.reliableQueue.uPayloadsRefused + s.unreliableQueue.uPayloadsRefused) + "}";
+  line += ",\"achieved\":{\"up_ms\":" + jsonNumber(row.up.latencyMs, 2) + ",\"up_loss\":" +
+          (row.up.loss() < 0 ? std::string("null") : jsonNumber(row.up.loss(), 4)) + ",\"down_ms\":" +
+          jsonNumber(row.downMs, 2) + ",\"down_loss\":" + (row.downLoss < 0 ? std::string("null") : jsonNumber(row.downLoss, 4)) +
+          "}}\n";
+  std::fputs(line.c_str(), out);
+}
+
+// The process's runtime over the last full second.
+struct RuntimeRow {
+  N_RuntimeStats stats;
+  double passes = 0, events = 0;  // per second
+};
+
+void drawTable(N_Server& server, std::map<N_Client*, ClientRow>& rows, const RuntimeRow& runtime, const Options& o,
+               int& lines) {
   if (lines > 0) std::printf("\x1b[%dA", lines);
   lines = 0;
   auto line = [&lines](const char* format, auto... values) {
@@ -178,6 +262,30 @@ void drawTable(N_Server& server, std::map<N_Client*, ClientRow>& rows, const Opt
          percent(row.up.loss()).c_str(), millis(row.downMs).c_str(), percent(row.downLoss).c_str(), row.x, row.y);
   }
   line("\n");
+  // The statistics of each connection (N_Client::getStatistics() on the
+  // server's end), as rates over the last full second.
+  line("traffic per second, as the server's end of each connection counts it (in: from the client, out: to it)\n");
+  line("%-12s %13s %13s %13s %13s %11s %16s %5s %6s %6s %7s\n", "client", "reliable in", "reliable out",
+       "unreliable in", "unrel. out", "control", "rtt ms, last 16", "repl", "sim", "sim", "waiting");
+  line("%-12s %5s %7s %5s %7s %5s %7s %5s %7s %5s %5s %16s %5s %6s %6s %7s\n", "", "msg", "B", "msg", "B", "msg", "B",
+       "msg", "B", "B in", "B out", "low/mean/high", "/s", "lost/s", "del/s", "B");
+  for (auto& [client, row] : rows) {
+    const Rates& r = row.rates;
+    const N_ClientStats& s = row.stats;
+    char rtt[40];
+    std::snprintf(rtt, sizeof rtt, "%.1f/%.1f/%.1f", s.fLatencyLowest * 1000.0, s.fLatencyMean * 1000.0,
+                  s.fLatencyHighest * 1000.0);
+    line("%-12s %5.0f %7.0f %5.0f %7.0f %5.0f %7.0f %5.0f %7.0f %5.0f %5.0f %16s %5.0f %6.0f %6.0f %7u\n",
+         row.name.c_str(), r.messagesIn[0], r.bytesIn[0], r.messagesOut[0], r.bytesOut[0], r.messagesIn[1],
+         r.bytesIn[1], r.messagesOut[1], r.bytesOut[1], r.bytesIn[2], r.bytesOut[2], rtt, r.replaced, r.lost,
+         r.delayed,
+         s.reliableQueue.uBytesWaiting + s.unreliableQueue.uBytesWaiting + s.reliable.uBytesWaitingForSend +
+             s.unreliable.uBytesWaitingForSend + s.control.uBytesWaitingForSend);
+  }
+  const N_RuntimeStats& rt = runtime.stats;
+  line("runtime: %u sockets and %u listeners open, %u B waiting for send, network thread %.0f passes/s, %.0f events/s\n",
+       rt.uOpenSockets, rt.uOpenListeners, rt.uBytesWaitingForSend, runtime.passes, runtime.events);
+  line("\n");
   std::fflush(stdout);
 }
 
@@ -192,6 +300,14 @@ int runServer(const Options& options) {
     std::map<N_Client*, ClientRow> rows;
     unsigned nextEntity = 1;
     auto start = Clock::now();
+    std::FILE* json = nullptr;
+    if (!options.json.empty() && (json = std::fopen(options.json.c_str(), "w")) == nullptr) {
+      std::printf("server: cannot write %s\n", options.json.c_str());
+      return 1;
+    }
+    RuntimeRow runtime;
+    runtime.stats = N_Initializer::getStatistics();
+    auto runtimeAt = start;
     auto nextDraw = start;
     auto nextSecond = start + std::chrono::seconds(1);
     int lines = 0;
@@ -204,6 +320,8 @@ int runServer(const Options& options) {
         ClientRow row;
         row.name = const_cast<const char*>(joined->getAddress()->getStringNumber());
         row.entity = nextEntity++;
+        row.stats = joined->getStatistics();
+        row.statsAt = Clock::now();
         rows[joined] = row;
       }
       std::vector<Record> positions;
@@ -248,19 +366,33 @@ int runServer(const Options& options) {
         flushCounted(*client, row.sentDown);
       }
       if (tick >= nextSecond) {
+        const double t = std::chrono::duration<double>(tick - start).count();
         for (auto& [client, row] : rows) {
           row.rate = static_cast<double>(row.messages);
           row.messages = 0;
           row.up.endSecond();
+          const N_ClientStats now = client->getStatistics();
+          row.rates = ratesBetween(row.stats, now, std::chrono::duration<double>(tick - row.statsAt).count());
+          row.stats = now;
+          row.statsAt = tick;
+          if (json != nullptr) writeJson(json, t, row);
         }
+        if (json != nullptr) std::fflush(json);
+        const N_RuntimeStats now = N_Initializer::getStatistics();
+        const double seconds = std::chrono::duration<double>(tick - runtimeAt).count();
+        runtime.passes = static_cast<double>(now.uNetworkPasses - runtime.stats.uNetworkPasses) / seconds;
+        runtime.events = static_cast<double>(now.uEventsServed - runtime.stats.uEventsServed) / seconds;
+        runtime.stats = now;
+        runtimeAt = tick;
         nextSecond += std::chrono::seconds(1);
       }
       if (tick >= nextDraw) {
-        drawTable(server, rows, options, lines);
+        drawTable(server, rows, runtime, options, lines);
         nextDraw = tick + std::chrono::milliseconds(250);
       }
       std::this_thread::sleep_until(tick + std::chrono::duration_cast<Clock::duration>(std::chrono::duration<double>(kTick)));
     }
+    if (json != nullptr) std::fclose(json);
     std::printf("Server stopping with %zu clients\n", rows.size());
   } catch (Q_Exception* e) {
     std::printf("server failed: %s\n", e->getErrorMessage());

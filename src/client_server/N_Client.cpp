@@ -5,6 +5,7 @@
 #include "ControlMessage.h"
 #include "N_Address.h"
 #include "Q_New.h"
+#include "RuntimeLock.h"
 
 std::atomic<float> N_Client::sm_fHeartbeatFrequency{4.0f};
 std::atomic<float> N_Client::sm_fHeartbeatLatency{2.0f};
@@ -60,6 +61,15 @@ void N_Client::initializeMembers() {
   m_pairingTimer.reset();
   m_bGrantAsked = false;
   m_pSimulation = nullptr;
+  m_reliableQueueStats = N_QueueStats{};
+  m_unreliableQueueStats = N_QueueStats{};
+  m_uSimulatedLost = 0;
+  m_uSimulatedDelayed = 0;
+  m_bGateHeldBack = false;
+  m_uHeartbeats = 0;
+  for (float& latency : m_afLatencyWindow) latency = 0.0f;
+  m_uWorldTimeExchanges = 0;
+  m_fWorldClockOffset = 0.0f;
 }
 
 void N_Client::construct(const N_Address* pAddress, int iPort) {
@@ -231,6 +241,7 @@ void N_Client::receiveHeartbeat() {
 
 void N_Client::receiveHeartbeatReply() {
   m_fLatency = m_heartbeatTimer.getAge();
+  m_afLatencyWindow[m_uHeartbeats++ % N_ClientStats::LATENCY_WINDOW] = m_fLatency;
   m_heartbeatState = HEARTBEAT_AWAIT_PEER;
   m_heartbeatTimer.reset();
 }
@@ -300,9 +311,52 @@ bool N_Client::updateWorldTimer() {
     const double estimate =
         (static_cast<double>(total) / (k + 1.0)) * kReturnShare + static_cast<double>(m_fWorldTimeReply);
     m_fWorldTimeReply = static_cast<float>(estimate);
+    m_fWorldClockOffset = m_fWorldTimeReply - m_worldTimer.getAge();
     m_worldTimer.setAge(m_fWorldTimeReply);
+    ++m_uWorldTimeExchanges;
   }
   return true;
 }
 
 const Q_Timer& N_Client::getWorldTimer() const { return m_worldTimer; }
+
+// ---------------------------------------------------------------------------
+// statistics
+
+N_ClientStats N_Client::getStatistics() const {
+  N_ClientStats stats;
+  if (!m_bConstructed) return stats;
+  // One lock around the whole copy: the channel counts change on the network
+  // thread, under this mutex, and the copy's counts belong together.
+  RuntimeLock lock;
+  if (m_pTcpSocket != nullptr) stats.reliable = m_pTcpSocket->getStatistics();
+  if (m_pUdpSocket != nullptr) stats.unreliable = m_pUdpSocket->getStatistics();
+  if (m_pControlSocket != nullptr) stats.control = m_pControlSocket->getStatistics();
+  stats.reliableQueue = m_reliableQueueStats;
+  stats.reliableQueue.uBytesWaiting = m_uReliableBytes;
+  stats.unreliableQueue = m_unreliableQueueStats;
+  stats.unreliableQueue.uBytesWaiting = m_uUnreliableBytes;
+  stats.uSimulatedLost = m_uSimulatedLost;
+  stats.uSimulatedDelayed = m_uSimulatedDelayed;
+  stats.model = getSimulationStats();
+  stats.uHeartbeats = m_uHeartbeats;
+  stats.fLatency = m_fLatency;
+  const unsigned window = m_uHeartbeats < N_ClientStats::LATENCY_WINDOW ? static_cast<unsigned>(m_uHeartbeats)
+                                                                         : N_ClientStats::LATENCY_WINDOW;
+  if (window > 0) {
+    double sum = 0.0;
+    stats.fLatencyLowest = m_afLatencyWindow[0];
+    stats.fLatencyHighest = m_afLatencyWindow[0];
+    for (unsigned i = 0; i < window; ++i) {
+      const float latency = m_afLatencyWindow[i];
+      if (latency < stats.fLatencyLowest) stats.fLatencyLowest = latency;
+      if (latency > stats.fLatencyHighest) stats.fLatencyHighest = latency;
+      sum += static_cast<double>(latency);
+    }
+    stats.fLatencyMean = static_cast<float>(sum / window);
+  }
+  stats.uWorldTimeExchanges = m_uWorldTimeExchanges;
+  stats.fWorldClockOffset = m_fWorldClockOffset;
+  stats.uBandwidth = m_uBandwidth;
+  return stats;
+}

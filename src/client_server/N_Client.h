@@ -123,6 +123,7 @@
 #include <atomic>
 #include <cstdint>
 
+#include "N_ClientStats.h"
 #include "N_NetworkModel.h"
 #include "N_Socket.h"
 #include "Q_DLList.h"
@@ -365,6 +366,17 @@ class VARDEL_API N_Client {
   /// model never reached this connection's poll().
   N_SimulationStats getSimulationStats() const;
 
+  /// Everything this connection counts (N_ClientStats): bytes and messages of
+  /// each channel, what the payload queues took, replaced and refused, what
+  /// the simulated bad network did, the heartbeat latency of the last
+  /// N_ClientStats::LATENCY_WINDOW round trips, the world clock's last
+  /// correction and the bandwidth in force. One plain copy, taken under the
+  /// runtime's mutex; all 0 on an unconstructed object. The counting itself
+  /// is a few integer additions where the data passes anyway.
+  /// @note As every other call here, on the server end it must not run beside
+  /// another thread's N_Server::update (see Threads in the class).
+  N_ClientStats getStatistics() const;
+
  private:
   friend class N_Server;
   friend struct N_ClientTestAccess;
@@ -384,8 +396,10 @@ class VARDEL_API N_Client {
   void readControl();
   static void sendControl(N_Socket* socket, std::uint32_t type, std::uint32_t value = 0);
 
-  void queuePayload(Q_DLList<DataQueue>* queue, unsigned& bytes, void* pPayload, unsigned uSize, unsigned uKey,
-                    unsigned uPriority);
+  void queuePayload(Q_DLList<DataQueue>* queue, unsigned& bytes, N_QueueStats& stats, void* pPayload, unsigned uSize,
+                    unsigned uKey, unsigned uPriority);
+  // With the read gate shut: whether a message waits that it holds back.
+  bool messageWaiting(bool modelled);
   void flushQueue(Q_DLList<DataQueue>* queue, unsigned& bytes, N_Socket* socket, bool unreliable);
   static void clearQueue(Q_DLList<DataQueue>* queue, unsigned& bytes);
   static int flushCompareQSort(const void* a, const void* b);
@@ -433,6 +447,20 @@ class VARDEL_API N_Client {
   bool m_bGrantAsked;
   // Made by the first poll() that finds the network model on.
   Simulation* m_pSimulation;
+  // The statistics this object keeps itself (N_ClientStats); the sockets keep
+  // those of the channels. uBytesWaiting of the queue records is unused.
+  N_QueueStats m_reliableQueueStats;
+  N_QueueStats m_unreliableQueueStats;
+  std::uint64_t m_uSimulatedLost;
+  std::uint64_t m_uSimulatedDelayed;
+  // poll() found the read gate shut while a message waited; the next message
+  // handed out counts as delayed.
+  bool m_bGateHeldBack;
+  std::uint64_t m_uHeartbeats;
+  // The latest round trips, the one of heartbeat n at n % LATENCY_WINDOW.
+  float m_afLatencyWindow[N_ClientStats::LATENCY_WINDOW];
+  std::uint64_t m_uWorldTimeExchanges;
+  float m_fWorldClockOffset;
 
   static std::atomic<float> sm_fHeartbeatFrequency;
   static std::atomic<float> sm_fHeartbeatLatency;

@@ -21,11 +21,11 @@ struct FlushScratch {
 }  // namespace
 
 void N_Client::queueReliable(void* pPayload, unsigned uSize, unsigned uKey, unsigned uPriority) {
-  queuePayload(m_pReliableQueue, m_uReliableBytes, pPayload, uSize, uKey, uPriority);
+  queuePayload(m_pReliableQueue, m_uReliableBytes, m_reliableQueueStats, pPayload, uSize, uKey, uPriority);
 }
 
 void N_Client::queueUnreliable(void* pPayload, unsigned uSize, unsigned uKey, unsigned uPriority) {
-  queuePayload(m_pUnreliableQueue, m_uUnreliableBytes, pPayload, uSize, uKey, uPriority);
+  queuePayload(m_pUnreliableQueue, m_uUnreliableBytes, m_unreliableQueueStats, pPayload, uSize, uKey, uPriority);
 }
 
 void N_Client::flushReliable() { flushQueue(m_pReliableQueue, m_uReliableBytes, m_pTcpSocket, false); }
@@ -40,12 +40,16 @@ unsigned N_Client::getReliableBytesWaiting() const { return m_uReliableBytes; }
 
 unsigned N_Client::getUnreliableBytesWaiting() const { return m_uUnreliableBytes; }
 
-void N_Client::queuePayload(Q_DLList<DataQueue>* queue, unsigned& bytes, void* pPayload, unsigned uSize, unsigned uKey,
-                            unsigned uPriority) {
+void N_Client::queuePayload(Q_DLList<DataQueue>* queue, unsigned& bytes, N_QueueStats& stats, void* pPayload,
+                            unsigned uSize, unsigned uKey, unsigned uPriority) {
   // Four seconds of data at the rate in force. The bytes of an entry about
   // to be replaced still count here, so a replacement near the limit throws
   // even when the new payload is smaller.
-  if (uSize + bytes > m_uBandwidth * 4u) Q_ThrowPacketsStackingUp();
+  if (uSize + bytes > m_uBandwidth * 4u) {
+    // An unconstructed object counts nothing (its statistics are all 0).
+    if (m_bConstructed) ++stats.uPayloadsRefused;
+    Q_ThrowPacketsStackingUp();
+  }
   if (queue == nullptr) return;
 
   // The copy comes first: if it fails, the queue is untouched.
@@ -65,6 +69,7 @@ void N_Client::queuePayload(Q_DLList<DataQueue>* queue, unsigned& bytes, void* p
     // Replaced in place: the entry keeps its position in the list.
     Q_DeleteArray(entry->pData);
     bytes -= entry->uSize;
+    ++stats.uPayloadsReplaced;
   } else {
     try {
       entry = queue->append();
@@ -80,6 +85,7 @@ void N_Client::queuePayload(Q_DLList<DataQueue>* queue, unsigned& bytes, void* p
   entry->uSize = uSize;
   entry->pData = copy;
   bytes += uSize;
+  ++stats.uPayloadsQueued;
 }
 
 int N_Client::flushCompareQSort(const void* a, const void* b) {

@@ -27,7 +27,12 @@ bool N_Client::poll(void*& pMessage, unsigned& uMessageSize) {
   // The network model (off by default) takes in what the sockets hold on
   // every poll, gate shut or not, so that its arrival times are true ones.
   const bool modelled = simulateArrivals();
-  if (m_sendTimer.getAge() < m_fNextPollTime) return false;
+  if (m_sendTimer.getAge() < m_fNextPollTime) {
+    // The gate only shuts while simulateLatency() is on: only then is this
+    // look at the sockets paid for.
+    if (!m_bGateHeldBack) m_bGateHeldBack = messageWaiting(modelled);
+    return false;
+  }
 
   bool result = false;
   if (modelled ? takeSimulated(true, pMessage, uMessageSize) : m_pTcpSocket->poll(pMessage, uMessageSize)) {
@@ -37,6 +42,14 @@ bool N_Client::poll(void*& pMessage, unsigned& uMessageSize) {
     const float loss = sm_fSimulatedPacketLoss.load(std::memory_order_relaxed);
     // The message is taken from the socket either way; a lost one is gone.
     result = !(loss > 0.0f && draw() < static_cast<double>(loss));
+    if (!result) {
+      ++m_uSimulatedLost;
+      m_bGateHeldBack = false;
+    }
+  }
+  if (result && m_bGateHeldBack) {
+    ++m_uSimulatedDelayed;
+    m_bGateHeldBack = false;
   }
 
   const unsigned minimum = sm_uSimulatedMinLatency.load(std::memory_order_relaxed);

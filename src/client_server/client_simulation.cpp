@@ -232,6 +232,19 @@ bool N_Client::takeSimulated(bool reliable, void*& pMessage, unsigned& uMessageS
   return true;
 }
 
+bool N_Client::messageWaiting(bool modelled) {
+  if (modelled) {
+    // What the model holds is waiting once it is due (or at once with the
+    // model off); simulateArrivals() has just set the clock.
+    Simulation& s = *m_pSimulation;
+    for (Q_DLList<Held>* list : {&s.reliable, &s.unreliable})
+      for (Held* h = list->getFirst(); h != nullptr; h = list->getNext(h))
+        if (!s.bOn || h->dDue <= s.dNow) return true;
+    if (s.bOn) return false;
+  }
+  return m_pTcpSocket->getQueuedReceiveMessages() + m_pUdpSocket->getQueuedReceiveMessages() > 0;
+}
+
 void N_Client::deleteSimulation() {
   Q_Delete(m_pSimulation);
   m_pSimulation = nullptr;

@@ -66,6 +66,10 @@ void N_Socket::initializeMembers() {
   m_uQueuedSendMessages = 0;
   m_uQueuedReceiveBytes = 0;
   m_uQueuedReceiveMessages = 0;
+  m_uBytesSent = 0;
+  m_uMessagesSent = 0;
+  m_uBytesReceived = 0;
+  m_uMessagesReceived = 0;
   m_bReadPaused = false;
   m_bReadResume = false;
 }
@@ -277,6 +281,18 @@ unsigned int N_Socket::getQueuedSendMessages() const {
 unsigned int N_Socket::getQueuedReceiveMessages() const {
   RuntimeLock lock;
   return m_uQueuedReceiveMessages;
+}
+
+N_SocketStats N_Socket::getStatistics() const {
+  N_SocketStats stats;
+  RuntimeLock lock;
+  stats.uBytesSent = m_uBytesSent;
+  stats.uMessagesSent = m_uMessagesSent;
+  stats.uBytesReceived = m_uBytesReceived;
+  stats.uMessagesReceived = m_uMessagesReceived;
+  stats.uBytesWaitingForSend = m_uQueuedSendBytes;
+  stats.uBytesWaitingToPoll = m_uQueuedReceiveBytes;
+  return stats;
 }
 
 std::uint64_t N_Socket::receiveBacklogCost() const {

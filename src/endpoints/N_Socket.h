@@ -62,6 +62,7 @@
 #include <cstdint>
 #include <thread>
 
+#include "N_SocketStats.h"
 #include "Q_DLList.h"
 #include "vardel_export.h"
 #include "vardel_platform.h"
@@ -95,6 +96,7 @@ class VARDEL_API N_Socket {
     bool bComplete;                      ///< Message finished; on a send entry: its completion ran with an error.
     bool bConsumed;                      ///< poll() handed it out; the next poll() frees it.
     bool bLive;                          ///< The owning socket is alive.
+    bool bMessageEnd;                    ///< A send entry that carries the last byte of its message.
     N_Socket* pSocket;                   ///< The owning socket; null for an orphan.
   };
 
@@ -211,6 +213,10 @@ class VARDEL_API N_Socket {
   unsigned int getQueuedReceiveBytes() const;
   /// How many messages those bytes are in.
   unsigned int getQueuedReceiveMessages() const;
+  /// What this socket carried since construct(), copied out under the
+  /// runtime's mutex (see N_SocketStats for what counts as a byte and when);
+  /// all 0 on an unconstructed socket.
+  N_SocketStats getStatistics() const;
 
   /// The first slot of the runtime's socket registry, null if there is none
   /// (or the runtime is down); `*slot` is the socket. See the class about
@@ -312,7 +318,7 @@ class VARDEL_API N_Socket {
   // The send pump's pass in which a WSASend of this socket failed for a
   // reason it retries later; the socket's later entries wait for that retry,
   // so that the stream keeps its order.
-  unsigned int m_uPumpHeldPass;
+  std::uint64_t m_uPumpHeldPass;
   // Bytes allocated for m_pPacketBuffer while a body is collected; below
   // length + 4 while a long message grows with what arrived.
   std::int64_t m_iPacketCapacity;
@@ -322,6 +328,12 @@ class VARDEL_API N_Socket {
   unsigned int m_uQueuedSendMessages;
   unsigned int m_uQueuedReceiveBytes;
   unsigned int m_uQueuedReceiveMessages;
+  // What the socket carried (N_SocketStats), under the runtime's mutex:
+  // counted by sendComplete(), receiveComplete() and appendMessage().
+  std::uint64_t m_uBytesSent;
+  std::uint64_t m_uMessagesSent;
+  std::uint64_t m_uBytesReceived;
+  std::uint64_t m_uMessagesReceived;
   // What the unpolled messages count against the receive backlog.
   std::uint64_t receiveBacklogCost() const;
   // Reading stopped at the receive backlog; poll() sets m_bReadResume when

@@ -18,6 +18,7 @@ inline N_Socket::DataQueue* appendEntry(Q_DLList<N_Socket::DataQueue>* queue, N_
   entry->bComplete = complete;
   entry->bConsumed = false;
   entry->bLive = true;
+  entry->bMessageEnd = false;
   entry->pSocket = socket;
   return entry;
 }

@@ -96,6 +96,7 @@ N_Socket::DataQueue* N_Socket::appendMessage(char* buffer, char* data, unsigned 
   message->wsaBuf.buf = data;
   m_uQueuedReceiveBytes += size;
   ++m_uQueuedReceiveMessages;
+  ++m_uMessagesReceived;
   return message;
 }
 
@@ -334,6 +335,7 @@ void N_Initializer::receiveComplete(platform::DWORD error, platform::DWORD bytes
   N_Socket* socket = read->pSocket;
   if (read->bLive && socket != nullptr) {
     unsigned int size = std::min<unsigned int>(bytes, read->wsaBuf.len);
+    socket->m_uBytesReceived += size;
     const N_Limits limits = getLimits();
     const N_Socket::ReadLimits readLimits{limits.uMaximumMessageSize, limits.bCompactMessages};
     if (socket->m_bPackage)

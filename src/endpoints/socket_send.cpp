@@ -76,6 +76,8 @@ void N_Socket::send(void* data, unsigned int size) {
       entry->wsaBuf.len = c.length;
       if (first == nullptr) first = entry;
       ++appended;
+      // Its completion counts the message as sent.
+      entry->bMessageEnd = appended == chunks.size();
     }
   } catch (...) {
     // Nothing of a message that failed stays queued.
@@ -119,6 +121,8 @@ void N_Socket::sendComplete(platform::DWORD dwError, platform::DWORD cbTransferr
   if (socket != nullptr) {
     socket->m_uQueuedSendBytes -= entry->wsaBuf.len;
     --socket->m_uQueuedSendMessages;
+    socket->m_uBytesSent += entry->wsaBuf.len;
+    if (entry->bMessageEnd) ++socket->m_uMessagesSent;
   }
   Runtime::sendDone(entry);
 }

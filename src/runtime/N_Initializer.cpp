@@ -78,7 +78,8 @@ Q_DLList<N_Socket::DataQueue>* N_Initializer::m_pInProcessQueue = nullptr;
 Q_DLList<N_Socket::DataQueue>* N_Initializer::m_pOutProcessQueue = nullptr;
 N_Socket::DataQueue* N_Initializer::m_pPumpFrom = nullptr;
 unsigned int N_Initializer::m_uBytesWaitingForSend = 0;
-unsigned int N_Initializer::m_uPumpPass = 0;
+std::uint64_t N_Initializer::m_uNetworkPasses = 0;
+std::uint64_t N_Initializer::m_uEventsServed = 0;
 bool N_Initializer::m_bReadsToResume = false;
 
 N_Initializer::N_Initializer() : m_wsaData{} {
@@ -112,6 +113,8 @@ void N_Initializer::start() {
   m_pOutProcessQueue = Q_New<Q_DLList<N_Socket::DataQueue>>();
   m_pPumpFrom = nullptr;
   m_uBytesWaitingForSend = 0;
+  m_uNetworkPasses = 0;
+  m_uEventsServed = 0;
   m_bReadsToResume = false;
 
   m_hMutex = platform::CreateMutexA(nullptr, platform::FALSE, kNetworkMutexName);
@@ -232,6 +235,20 @@ void N_Initializer::stop() {
   platform::CloseHandle(m_hMutex);
   m_hMutex = nullptr;
   platform::WSACleanup();
+}
+
+N_RuntimeStats N_Initializer::getStatistics() {
+  N_RuntimeStats stats;
+  // A runtime that isn't up (or whose start failed before its mutex) has
+  // nothing to count.
+  if (m_uInstance == 0 || m_hMutex == nullptr) return stats;
+  RuntimeLock lock;
+  if (m_pSockets != nullptr) stats.uOpenSockets = static_cast<unsigned>(m_pSockets->m_iCount);
+  if (m_pListeners != nullptr) stats.uOpenListeners = static_cast<unsigned>(m_pListeners->m_iCount);
+  stats.uBytesWaitingForSend = m_uBytesWaitingForSend;
+  stats.uNetworkPasses = m_uNetworkPasses;
+  stats.uEventsServed = m_uEventsServed;
+  return stats;
 }
 
 void N_Initializer::releaseThreadLoop() { platform::WSASetEvent(m_eventRelease); }

@@ -49,6 +49,7 @@
 #include <cstdint>
 
 #include "N_Limits.h"
+#include "N_RuntimeStats.h"
 #include "N_Socket.h"
 #include "Q_DLList.h"
 #include "vardel_export.h"
@@ -102,6 +103,10 @@ class VARDEL_API N_Initializer {
   static void setLimits(const N_Limits& limits);
   /// The protections in force; N_Limits::defaults() until setLimits().
   static N_Limits getLimits();
+  /// The runtime's counts for the whole process (N_RuntimeStats), copied out
+  /// under its mutex; all 0 while no runtime runs. Any thread, while an
+  /// N_Initializer lives.
+  static N_RuntimeStats getStatistics();
 
  private:
   friend class Runtime;  // the owner of the shared state below
@@ -164,7 +169,10 @@ class VARDEL_API N_Initializer {
   // Facts kept beside the out queue (see send_queue.cpp).
   static N_Socket::DataQueue* m_pPumpFrom;
   static unsigned int m_uBytesWaitingForSend;
-  static unsigned int m_uPumpPass;
+  // The network thread's passes (numbered by pumpSends, which runs once in
+  // each; 0 is never a pass number) and the events it served, under m_hMutex.
+  static std::uint64_t m_uNetworkPasses;
+  static std::uint64_t m_uEventsServed;
   // Set (under m_hMutex) when a paused socket may read again; the next pass
   // walks the sockets for it.
   static bool m_bReadsToResume;

@@ -2,6 +2,7 @@
 // listeners: the wait set and the service of one signalled event (the send
 // pump is with the rest of the send queue, in send_queue.cpp). All of it
 // runs on the network thread with m_hMutex held.
+#include <cstdint>
 #include <cstring>
 
 #include "N_Exceptions.h"
@@ -82,6 +83,7 @@ void N_Initializer::serveEvent(platform::WSAEVENT handle) {
       break;
     }
   }
+  if (socket != nullptr || listener != nullptr) ++m_uEventsServed;
 
   if (socket != nullptr) {
     // Zeroed first: a failed enumeration must not serve an old record again.

@@ -2,6 +2,8 @@
 // issues, and what completions and destroyed sockets take out. Every rule
 // about the queue's order, its byte count and where the pump starts is
 // here. All of it runs with the runtime's mutex held.
+#include <cstdint>
+
 #include "N_Initializer.h"
 #include "N_Socket.h"
 #include "Q_New.h"
@@ -57,10 +59,10 @@ void Runtime::orphan(const N_Socket* socket) {
 }
 
 void N_Initializer::pumpSends() {
-  // Numbers the pumps so that a socket can be held for the rest of one
-  // without a walk to clear the marks (0 is never a pump's number).
-  if (++m_uPumpPass == 0) m_uPumpPass = 1;
-  const unsigned int pass = m_uPumpPass;
+  // Numbers the passes, for the statistics and so that a socket can be held
+  // for the rest of one without a walk to clear the marks (64 bits never
+  // wrap back to 0, which is no pass).
+  const std::uint64_t pass = ++m_uNetworkPasses;
   Q_DLList<N_Socket::DataQueue>* queue = m_pOutProcessQueue;
   // Entries before m_pPumpFrom are issued and live: only their completions
   // can change them, so the walk starts behind them.

@@ -1,0 +1,81 @@
+// The other end of one connection played by plain Linux sockets, for the
+// statistics tests: the data stream, the control stream and the datagrams,
+// each counted byte by byte and message by message in both directions, as
+// the peer's system saw them (a stream's 4-byte prefixes included).
+//
+// A thread of its own reads all three channels. On the control channel it
+// keeps the heartbeat going: every heartbeat gets a reply and a heartbeat of
+// its own, and every world-time request an answer.
+// Kept apart from the library's headers, whose Winsock names Linux's macros
+// would clash with.
+#pragma once
+
+#include <atomic>
+#include <chrono>
+#include <cstddef>
+#include <cstdint>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <vector>
+
+namespace raw_peer {
+
+struct Tally {
+  std::uint64_t bytes = 0;
+  std::uint64_t messages = 0;
+};
+
+// One direction of the three channels.
+struct Direction {
+  Tally reliable, unreliable, control;
+};
+
+class RawPeer {
+ public:
+  // As the server: listens on ip:port and ip:6000, and exchanges datagrams
+  // between ip:port+1 and peerIp:port+1. As the client: connects from ip to
+  // peerIp:port and peerIp:6000, datagrams the same way.
+  RawPeer(bool server, const char* ip, const char* peerIp, std::uint16_t port);
+  ~RawPeer();
+  RawPeer(const RawPeer&) = delete;
+  RawPeer& operator=(const RawPeer&) = delete;
+
+  // Both streams are accepted (server) or connected (client).
+  bool connected() const { return m_bConnected; }
+  // One packaged message of `size` bytes of `fill` on the data stream.
+  void sendReliable(std::size_t size, char fill);
+  void sendUnreliable(std::size_t size, char fill);
+  // A control message: the type word, and the value word for types 1, 2, 8.
+  void sendControl(std::uint32_t type, std::uint32_t value = 0);
+
+  Direction sent();
+  Direction received();
+  // Received control messages of `type`.
+  unsigned controlCount(std::uint32_t type);
+
+  // The world time it answers: this plus its own age.
+  std::atomic<float> worldTime{50.0f};
+
+ private:
+  void run();
+  // False once the stream has ended.
+  bool readStream(int fd, std::vector<char>& pending, Tally& tally, bool control);
+  void send(int fd, const std::vector<char>& bytes, Tally& tally);
+
+  std::chrono::steady_clock::time_point m_start;
+  int m_dataListener = -1, m_controlListener = -1;
+  // Set by the thread when accepted, read by the senders.
+  std::atomic<int> m_data{-1}, m_control{-1};
+  int m_udp = -1;
+  std::atomic<bool> m_bConnected{false};
+  std::atomic<bool> m_bStop{false};
+  std::mutex m_write;  // one writer at a time on each stream
+  std::mutex m_lock;   // the tallies
+  Direction m_sent, m_received;
+  std::vector<unsigned> m_controlTypes;
+  std::vector<char> m_dataPending, m_controlPending;
+  std::thread m_thread;
+};
+
+}  // namespace raw_peer
