@@ -25,6 +25,7 @@
 #include "N_Listener.h"
 #include "N_Socket.h"
 #include "bench_client_server.h"
+#include "bench_wait.h"
 #include "peer_transports.h"
 #include "plain_tcp.h"
 #include "report.h"
@@ -198,6 +199,14 @@ bench::Measure measure(const std::string& name, const std::string& unit, bool hi
 int main(int argc, char** argv) {
   if (argc == 5 && std::strcmp(argv[1], "--client-peer") == 0)
     return clientPeer(argv[2], std::atoi(argv[3]), std::atof(argv[4]));
+  if (argc >= 2 && std::strcmp(argv[1], "--wait-cost") == 0) {
+    std::vector<unsigned> counts;
+    for (int i = 2; i < argc; ++i) counts.push_back(static_cast<unsigned>(std::atoi(argv[i])));
+    if (counts.empty()) counts = {64, 256, 1024, 4096};
+    for (const WaitCost& cost : benchWaitCost(counts, 2.0))
+      if (cost.microsPerRound <= 0) return 1;
+    return 0;
+  }
   bool quick = false;
   int rounds = 0;
   std::string json;

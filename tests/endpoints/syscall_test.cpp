@@ -4,7 +4,7 @@
 // must come through whole and in order, and what can't be made must fail the
 // way the matching Winsock error does, never end the process.
 #include <netinet/in.h>
-#include <poll.h>
+#include <sys/epoll.h>
 #include <sys/socket.h>
 #include <sys/uio.h>
 
@@ -77,9 +77,9 @@ long choppyRecvmsg(int fd, msghdr* message, int flags) {
 
 // A wait that wakes with nothing every other time (a look without waiting
 // still sees what is ready).
-int restlessPoll(pollfd* fds, unsigned long count, int timeout) {
+int restlessWait(int epfd, epoll_event* events, int count, int timeout) {
   if (timeout != 0 && g_polls++ % 2 == 0) return 0;
-  return ::poll(fds, count, timeout);
+  return ::epoll_wait(epfd, events, count, timeout);
 }
 
 int noDescriptor(int, int, int) {
@@ -135,7 +135,7 @@ TEST_F(SyscallTest, StreamsComeThroughShortWritesInterruptionsAndRefusals) {
   ASSERT_TRUE(connectPair(listener, port(), d, c));
   platform::sys::calls().sendmsg = choppySendmsg;
   platform::sys::calls().recvmsg = choppyRecvmsg;
-  platform::sys::calls().poll = restlessPoll;
+  platform::sys::calls().epoll_wait = restlessWait;
   exchange(a, b, 40);
   exchange(c, d, 10);
   EXPECT_GT(g_sends.load(), 1000);  // the calls did go through the table
