@@ -228,7 +228,7 @@ class WaitSet {
   void noteSignalled(WaitEntry& entry);
   void noteRelink(WaitEntry& entry);
   void noteClosed() { stale_ = true; }
-  void noteRefused();
+  void noteRefused();  // the socket's Watch says which registration
 
  private:
   struct Registration {
@@ -256,7 +256,7 @@ class WaitSet {
   std::vector<WaitEntry*> relinks_;
   bool sleeping_ = false;
   std::atomic<bool> stale_{false};    // an event of the last wait was closed: resolve anew
-  std::atomic<bool> refused_{false};  // a registration was refused: apply all again
+  std::atomic<bool> refused_{false};  // a registration was refused: apply it again
 };
 
 // Every thread that issues overlapped I/O or waits owns one reactor: its queue
@@ -366,6 +366,7 @@ struct SocketState {
   struct Watch {
     WaitSet* set;
     std::uint64_t id;
+    bool refused;  // the set's descriptor refused the last change
   };
   std::vector<Watch> watches;
   std::uint32_t interest = 0;

@@ -71,7 +71,8 @@ void closeLocked(SocketState& socket) {
   // Out of every wait set's descriptor before the number can be reused; a
   // refusal doesn't matter, as the close below takes it out too.
   for (const SocketState::Watch& watch : socket.watches)
-    if (socket.interest != 0 && socket.fd >= 0) watch.set->control(socket.fd, watch.id, socket.interest, 0);
+    if ((socket.interest != 0 || watch.refused) && socket.fd >= 0)
+      watch.set->control(socket.fd, watch.id, watch.refused ? ~0u : socket.interest, 0);
   socket.watches.clear();
   socket.interest = 0;
   // A listening socket stops listening now: close alone would keep the port

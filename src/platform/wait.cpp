@@ -86,8 +86,10 @@ void syncInterest(SocketState& socket) {
   if (want == socket.interest) return;
   const std::uint32_t had = socket.interest;
   socket.interest = want;
-  for (const SocketState::Watch& watch : socket.watches) {
-    if (watch.set->control(socket.fd, watch.id, had, want)) continue;
+  for (SocketState::Watch& watch : socket.watches) {
+    // One refused before is in an unknown state: applied whole.
+    watch.refused = !watch.set->control(socket.fd, watch.id, watch.refused ? ~0u : had, want);
+    if (!watch.refused) continue;
     std::lock_guard<std::mutex> hold(eventLock());
     watch.set->noteRefused();
   }
@@ -258,7 +260,7 @@ bool WaitSet::ref(const std::shared_ptr<SocketState>& socket) {
   if (socket->closed || socket->fd < 0) return true;  // never in the descriptor; only counted
   syncInterest(*socket);
   try {
-    socket->watches.push_back({this, id});
+    socket->watches.push_back({this, id, false});
   } catch (...) {
     ids_.erase(id);
     sockets_.erase(socket.get());
@@ -283,7 +285,7 @@ void WaitSet::unref(SocketState* socket) {
   auto watch = std::find_if(keep->watches.begin(), keep->watches.end(),
                             [&](const SocketState::Watch& w) { return w.set == this; });
   if (watch == keep->watches.end()) return;  // closed meanwhile: out of the descriptor already
-  if (keep->interest != 0) control(keep->fd, id, keep->interest, 0);
+  if (keep->interest != 0 || watch->refused) control(keep->fd, id, watch->refused ? ~0u : keep->interest, 0);
   keep->watches.erase(watch);
 }
 
@@ -319,16 +321,19 @@ bool WaitSet::settle(std::vector<IoSocket>& io) {
     return false;
   }
   if (!refused_.exchange(false)) return true;
-  // The system refused a change of registration: apply every one again.
+  // The system refused to change registrations: each is applied whole, and
+  // what goes through stays done if another is refused again.
   for (auto& [state, registration] : sockets_) {
     SocketState& socket = *registration.socket;
     std::lock_guard<std::mutex> hold(socket.lock);
-    const bool watched = std::any_of(socket.watches.begin(), socket.watches.end(),
-                                     [&](const SocketState::Watch& w) { return w.set == this; });
-    if (!watched || control(socket.fd, registration.id, ~0u, socket.interest)) continue;
-    fail(wsaErrorFromErrno(errno));
-    refused_ = true;
-    return false;
+    for (SocketState::Watch& watch : socket.watches) {
+      if (watch.set != this || !watch.refused) continue;
+      watch.refused = !control(socket.fd, watch.id, ~0u, socket.interest);
+      if (!watch.refused) continue;
+      fail(wsaErrorFromErrno(errno));
+      refused_ = true;
+      return false;
+    }
   }
   return true;
 }
