@@ -229,9 +229,10 @@ std::vector<ScaleFigures> benchScaling(const ScaleOptions& options) {
   N_Initializer::setMaximumWaitEvents(options.waitEvents);
   N_Initializer network;
   std::vector<ScaleFigures> all;
-  std::printf("\nA server with N client processes (64-byte unreliable payloads at 20 Hz, a reliable event a "
-              "second), wait set %u, %.0f s measured each\n",
-              N_Initializer::getMaximumWaitEvents(), options.seconds);
+  std::printf(
+      "\nA server with N client processes (64-byte unreliable payloads at 20 Hz, a reliable event a "
+      "second), wait set %u, %.0f s measured each\n",
+      N_Initializer::getMaximumWaitEvents(), options.seconds);
   std::printf("%8s %10s %22s %26s %12s %8s\n", "clients", "connected", "reliable delivered", "unreliable delivered",
               "server CPU", "load");
   for (int count : options.sizes) {
@@ -239,8 +240,7 @@ std::vector<ScaleFigures> benchScaling(const ScaleOptions& options) {
     std::printf("%8d %6d/%-3d %8lu/%-6lu %6.1f%% %10lu/%-7lu %6.1f%% %10.1f%% %8.2f%s\n", f.clients, f.connected,
                 f.clients, f.reliableDelivered, f.reliableSent, share(f.reliableDelivered, f.reliableSent),
                 f.unreliableDelivered, f.unreliableSent, share(f.unreliableDelivered, f.unreliableSent),
-                f.serverCpuPercent, f.loadAfter,
-                f.reported < f.connected ? "  (some clients never reported)" : "");
+                f.serverCpuPercent, f.loadAfter, f.reported < f.connected ? "  (some clients never reported)" : "");
     if (f.reliableDisorder > 0) std::printf("         ! %lu reliable events out of order\n", f.reliableDisorder);
     std::fflush(stdout);
     all.push_back(f);

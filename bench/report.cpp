@@ -224,9 +224,8 @@ bool writeScalingJson(const ScaleOptions& options, const std::vector<ScaleFigure
                  "\"unreliable_delivered\": %lu, \"seconds\": %s, \"server_cpu_percent_of_one_core\": %s, "
                  "\"load_average_before\": %s, \"load_average_after\": %s}%s\n",
                  s.clients, s.connected, s.reported, s.reliableSent, s.reliableDelivered, s.reliableDisorder,
-                 s.unreliableSent, s.unreliableDelivered, number(s.seconds).c_str(),
-                 number(s.serverCpuPercent).c_str(), number(s.loadBefore).c_str(), number(s.loadAfter).c_str(),
-                 i + 1 < sizes.size() ? "," : "");
+                 s.unreliableSent, s.unreliableDelivered, number(s.seconds).c_str(), number(s.serverCpuPercent).c_str(),
+                 number(s.loadBefore).c_str(), number(s.loadAfter).c_str(), i + 1 < sizes.size() ? "," : "");
   }
   std::fprintf(f, "  ],\n  \"wait_cost\": [");
   for (std::size_t i = 0; i < waits.size(); ++i)

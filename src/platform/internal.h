@@ -173,7 +173,7 @@ struct WaitEntry {
   // Owner only.
   DWORD index = 0;  // the lowest index of the event in the wait's array
   DWORD nextIndex = 0;
-  unsigned epoch = 0;  // the last array that named it
+  unsigned epoch = 0;                   // the last array that named it
   std::shared_ptr<SocketState> socket;  // the linked socket it keeps registered
 };
 
@@ -248,7 +248,7 @@ class WaitSet {
   std::unordered_map<std::uint64_t, std::unique_ptr<WaitEntry>> entries_;  // by handle
   std::unordered_map<SocketState*, Registration> sockets_;
   std::unordered_map<std::uint64_t, SocketState*> ids_;  // what epoll names
-  std::uint64_t nextId_ = 1;  // 0 names the wake-up descriptor
+  std::uint64_t nextId_ = 1;                             // 0 names the wake-up descriptor
   unsigned epoch_ = 0;
   std::vector<SocketState*> released_;
   // Guarded by the event lock.
@@ -305,7 +305,7 @@ class Reactor {
 // global event lock; lock order is socket lock, then event lock.
 struct EventObject {
   bool signalled = false;
-  WaitEntry* waiters = nullptr;  // of the wait sets that hold it, linked through the entries
+  WaitEntry* waiters = nullptr;       // of the wait sets that hold it, linked through the entries
   std::weak_ptr<SocketState> socket;  // set by WSAEventSelect
 };
 

@@ -25,9 +25,8 @@ int realEpollWait(int epfd, ::epoll_event* events, int count, int timeout) {
   return ::epoll_wait(epfd, events, count, timeout);
 }
 
-Calls g_calls{{realSocket},  {realAccept4},      {realSendmsg},  {realRecvmsg},
-              {realPoll},    {realEventfd},      {realEpollCreate1}, {realEpollCtl},
-              {realEpollWait}};
+Calls g_calls{{realSocket},  {realAccept4},      {realSendmsg},  {realRecvmsg},  {realPoll},
+              {realEventfd}, {realEpollCreate1}, {realEpollCtl}, {realEpollWait}};
 
 }  // namespace
 

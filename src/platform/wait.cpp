@@ -81,8 +81,7 @@ void serveReadiness(SocketState& socket, short revents) {
 }  // namespace
 
 void syncInterest(SocketState& socket) {
-  const std::uint32_t want =
-      socket.closed || socket.fd < 0 ? 0 : static_cast<std::uint16_t>(pollInterest(socket));
+  const std::uint32_t want = socket.closed || socket.fd < 0 ? 0 : static_cast<std::uint16_t>(pollInterest(socket));
   if (want == socket.interest) return;
   const std::uint32_t had = socket.interest;
   socket.interest = want;

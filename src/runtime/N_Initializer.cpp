@@ -254,7 +254,7 @@ void N_Initializer::releaseThreadLoop() { platform::WSASetEvent(m_eventRelease);
 
 void N_Initializer::setMaximumWaitEvents(unsigned uMaximumWaitEvents) {
   g_waitEventsSet.store(std::clamp<platform::DWORD>(uMaximumWaitEvents, platform::WSA_MAXIMUM_WAIT_EVENTS,
-                                                     platform::LARGEST_WAIT_EVENTS));
+                                                    platform::LARGEST_WAIT_EVENTS));
 }
 
 unsigned N_Initializer::getMaximumWaitEvents() {
