@@ -5,8 +5,8 @@
     bench/plot_scaling.py RESULTS.json OUT.png [--before N:US,N:US,...] [--title TEXT]
 
 Left: the server's CPU time per second of wall time (% of one core) for each
-number of client processes, each point labelled with the share of unreliable
-payloads delivered of those sent; a dashed line marks 25%. Right: what one
+number of client processes, with what was delivered of what the clients
+sent; a dashed line marks 25%. Right: what one
 event costs the platform layer's wait beside N handles; --before adds the
 same measure of an earlier build (microseconds per event at N handles) for
 comparison. Needs matplotlib: Debian's python3-matplotlib, for the system's
@@ -50,12 +50,14 @@ def main():
     clients = [s["clients"] for s in sizes]
     percent = [s["server_cpu_percent_of_one_core"] for s in sizes]
     cpu.plot(clients, percent, "o-", color="#1f77b4", label="server CPU")
-    for s, x, y in zip(sizes, clients, percent):
+    lines = []
+    for s in sizes:
         sent = s["unreliable_sent"]
         share = 100.0 * s["unreliable_delivered"] / sent if sent else 0.0
-        events = f'{s["reliable_delivered"]}/{s["reliable_sent"]} events'
-        cpu.annotate(f'{s["connected"]}/{s["clients"]} connected\n{share:.1f}% unreliable\n{events}',
-                     (x, y), textcoords="offset points", xytext=(6, 6), fontsize=7)
+        lines.append(f'{s["clients"]:>4}: {s["connected"]} connected, {share:.1f}% unreliable, '
+                     f'{s["reliable_delivered"]}/{s["reliable_sent"]} events')
+    cpu.text(0.03, 0.72, "delivered\n" + "\n".join(lines), transform=cpu.transAxes, fontsize=7,
+             family="monospace", va="top", bbox={"facecolor": "white", "edgecolor": "#cccccc"})
     cpu.axhline(25, color="grey", linestyle="--", linewidth=1, label="goal: under 25%")
     cpu.set_xlabel("client processes (64 B unreliable at 20 Hz, a reliable event a second)")
     cpu.set_ylabel("server CPU, % of one core")
