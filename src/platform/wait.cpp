@@ -175,6 +175,7 @@ bool WaitSet::use(DWORD count, const WSAEVENT* handles) {
   std::vector<std::uint64_t> created;
   const auto undo = [&] {
     for (std::uint64_t key : created) entries_.erase(key);
+    if (stale) stale_ = true;  // the next wait looks at every handle again
   };
   try {
     // Every handle resolved, and every allocation made, before anything that

@@ -381,8 +381,10 @@ TEST(Wait, AnyOfThousandsGivesTheLowestSignalledIndex) {
   EXPECT_EQ(640u, wait(e, 5000));
   setter.join();
   ASSERT_TRUE(WSACloseEvent(e[3]));
-  EXPECT_EQ(~0u, wait(e));
-  EXPECT_EQ(WSA_INVALID_HANDLE, WSAGetLastError());
+  for (int again = 0; again < 2; ++again) {
+    EXPECT_EQ(~0u, wait(e));
+    EXPECT_EQ(WSA_INVALID_HANDLE, WSAGetLastError());
+  }
   e[3] = WSACreateEvent();
   EXPECT_EQ(640u, wait(e));
   pairs.clear();
