@@ -206,4 +206,33 @@ bool writeJson(const Report& report, const ClientServerFigures& cs, const std::s
   return std::fclose(f) == 0;
 }
 
+bool writeScalingJson(const ScaleOptions& options, const std::vector<ScaleFigures>& sizes,
+                      const std::vector<WaitCost>& waits, const std::string& path) {
+  std::FILE* f = std::fopen(path.c_str(), "w");
+  if (f == nullptr) return false;
+  std::fprintf(f, "{\n  \"date\": %s,\n", quoted(utcNow()).c_str());
+  std::fprintf(f, "  \"machine\": {\"cpu\": %s, \"cores\": %u, \"system\": %s},\n", quoted(cpuModel()).c_str(),
+               std::thread::hardware_concurrency(), quoted(kernel()).c_str());
+  std::fprintf(f, "  \"wait_events\": %u,\n  \"seconds_per_size\": %s,\n", options.waitEvents,
+               number(options.seconds).c_str());
+  std::fprintf(f, "  \"sizes\": [\n");
+  for (std::size_t i = 0; i < sizes.size(); ++i) {
+    const ScaleFigures& s = sizes[i];
+    std::fprintf(f,
+                 "    {\"clients\": %d, \"connected\": %d, \"reported\": %d, \"reliable_sent\": %lu, "
+                 "\"reliable_delivered\": %lu, \"reliable_out_of_order\": %lu, \"unreliable_sent\": %lu, "
+                 "\"unreliable_delivered\": %lu, \"seconds\": %s, \"server_cpu_percent_of_one_core\": %s, "
+                 "\"load_average_before\": %s, \"load_average_after\": %s}%s\n",
+                 s.clients, s.connected, s.reported, s.reliableSent, s.reliableDelivered, s.reliableDisorder,
+                 s.unreliableSent, s.unreliableDelivered, number(s.seconds).c_str(), number(s.serverCpuPercent).c_str(),
+                 number(s.loadBefore).c_str(), number(s.loadAfter).c_str(), i + 1 < sizes.size() ? "," : "");
+  }
+  std::fprintf(f, "  ],\n  \"wait_cost\": [");
+  for (std::size_t i = 0; i < waits.size(); ++i)
+    std::fprintf(f, "%s{\"handles\": %u, \"us_per_event\": %s}", i ? ", " : "", waits[i].handles,
+                 number(waits[i].microsPerRound).c_str());
+  std::fprintf(f, "]\n}\n");
+  return std::fclose(f) == 0;
+}
+
 }  // namespace bench

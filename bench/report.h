@@ -7,6 +7,8 @@
 #include <vector>
 
 #include "bench_client_server.h"
+#include "bench_scaling.h"
+#include "bench_wait.h"
 
 namespace bench {
 
@@ -40,5 +42,8 @@ struct Report {
 double loadAverage();  // -1 where the system does not say
 void printTable(const Report& report);
 bool writeJson(const Report& report, const ClientServerFigures& clientServer, const std::string& path);
+// The figures of a --scaling run, which bench/plot_scaling.py draws.
+bool writeScalingJson(const ScaleOptions& options, const std::vector<ScaleFigures>& sizes,
+                      const std::vector<WaitCost>& waits, const std::string& path);
 
 }  // namespace bench

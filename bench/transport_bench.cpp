@@ -3,6 +3,7 @@
 // found at build time, ENet and ZeroMQ, all measured in one run.
 //
 //   vardel_bench [--quick] [--rounds N] [--json FILE]
+//   vardel_bench --scaling [--seconds S] [--sizes 20,50,100,200] [--json FILE]
 //
 // Throughput is one-way, every message checked (size, content, order) at the
 // receiver. The round trip is a 32-byte message echoed by the peer. Each
@@ -10,6 +11,10 @@
 // times as many, shorter ones for the round trip); within a round every
 // transport runs once, in an order that rotates from round to round, so that
 // a slow spell of the machine falls on all of them alike.
+//
+// --scaling measures instead a server with many client processes at each
+// size (bench_scaling.cpp), and the platform layer's wait beside 64 to 4096
+// handles (bench_wait.cpp); bench/plot_scaling.py draws its JSON.
 #include <atomic>
 #include <chrono>
 #include <condition_variable>
@@ -25,6 +30,8 @@
 #include "N_Listener.h"
 #include "N_Socket.h"
 #include "bench_client_server.h"
+#include "bench_scaling.h"
+#include "bench_wait.h"
 #include "peer_transports.h"
 #include "plain_tcp.h"
 #include "report.h"
@@ -193,11 +200,46 @@ bench::Measure measure(const std::string& name, const std::string& unit, bool hi
   return m;
 }
 
+// A server with 20 to 200 clients, and the platform's wait beside 64 to 4096
+// handles: how their cost grows.
+int scaling(int argc, char** argv) {
+  ScaleOptions options;
+  std::string json;
+  for (int i = 2; i + 1 < argc; i += 2) {
+    if (std::strcmp(argv[i], "--seconds") == 0) {
+      options.seconds = std::atof(argv[i + 1]);
+    } else if (std::strcmp(argv[i], "--sizes") == 0) {
+      options.sizes.clear();
+      for (const char* at = argv[i + 1]; *at != 0;) {
+        char* end = nullptr;
+        options.sizes.push_back(static_cast<int>(std::strtol(at, &end, 10)));
+        at = *end == ',' ? end + 1 : end;
+      }
+    } else if (std::strcmp(argv[i], "--json") == 0) {
+      json = argv[i + 1];
+    }
+  }
+  const std::vector<ScaleFigures> sizes = benchScaling(options);
+  const std::vector<WaitCost> waits = benchWaitCost({64, 256, 1024, 4096}, 2.0);
+  if (!json.empty() && !bench::writeScalingJson(options, sizes, waits, json)) {
+    std::fprintf(stderr, "could not write %s\n", json.c_str());
+    return 1;
+  }
+  bool complete = true;
+  for (const ScaleFigures& f : sizes)
+    complete = complete && f.connected == f.clients && f.reported == f.clients && f.reliableDisorder == 0 &&
+               f.reliableDelivered == f.reliableSent;
+  for (const WaitCost& w : waits) complete = complete && w.microsPerRound > 0;
+  return complete ? 0 : 1;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
   if (argc == 5 && std::strcmp(argv[1], "--client-peer") == 0)
     return clientPeer(argv[2], std::atoi(argv[3]), std::atof(argv[4]));
+  if (argc == 4 && std::strcmp(argv[1], "--scale-client") == 0) return scaleClient(argv[2], std::atoi(argv[3]));
+  if (argc >= 2 && std::strcmp(argv[1], "--scaling") == 0) return scaling(argc, argv);
   bool quick = false;
   int rounds = 0;
   std::string json;
@@ -212,7 +254,10 @@ int main(int argc, char** argv) {
     } else if (std::strcmp(argv[i], "--json") == 0 && i + 1 < argc) {
       json = argv[++i];
     } else {
-      std::fprintf(stderr, "usage: %s [--quick] [--rounds N] [--json FILE] | --size BYTES\n", argv[0]);
+      std::fprintf(stderr,
+                   "usage: %s [--quick] [--rounds N] [--json FILE] | --size BYTES\n"
+                   "       %s --scaling [--seconds S] [--sizes N,N,...] [--json FILE]\n",
+                   argv[0], argv[0]);
       return 2;
     }
   }

@@ -37,6 +37,13 @@
 /// died or whose heartbeat timed out stays (isConnected() false) and keeps its
 /// share of the bandwidth until the application calls disconnectClient().
 ///
+/// @par How many clients
+/// Each client is three sockets of the network thread's wait set, beside the
+/// server's two listeners and the thread's release event: the default set of
+/// 64 holds 20 clients; once it is full the listeners are left out, and a
+/// 21st client never completes its connection. N_Initializer::setMaximumWaitEvents(),
+/// before the runtime starts, makes room for more: 3 x clients + 3.
+///
 /// @par Bandwidth
 /// Each client's share is the smaller of what it asked for and
 /// getMaximumBandwidthUsage() (default 10240). If the shares together exceed

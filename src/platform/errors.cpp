@@ -64,6 +64,7 @@ namespace detail {
   X(EPIPE, WSAECONNRESET)              \
   X(ENOBUFS, WSAENOBUFS)               \
   X(ENOMEM, WSAENOBUFS)                \
+  X(ENOSPC, WSAENOBUFS)                \
   X(EISCONN, WSAEISCONN)               \
   X(ENOTCONN, WSAENOTCONN)             \
   X(ESHUTDOWN, WSAESHUTDOWN)           \

@@ -1,5 +1,5 @@
-// Manual-reset event objects. A waiting thread registers its reactor with
-// each event of its wait; setting an event wakes the registered reactors.
+// Manual-reset event objects. The wait set of each thread that waits on an
+// event is among its waiters; setting the event tells them.
 #include "internal.h"  // first: see the note there
 
 namespace platform {
@@ -25,7 +25,8 @@ std::shared_ptr<EventObject> findEvent(WSAEVENT handle) {
 void signalLocked(EventObject& event) {
   if (event.signalled) return;
   event.signalled = true;
-  for (Reactor* waiter : event.waiters) waiter->wake();
+  for (WaitEntry* waiter = event.waiters; waiter != nullptr; waiter = waiter->nextWaiter)
+    waiter->set->noteSignalled(*waiter);
 }
 
 }  // namespace detail
@@ -45,9 +46,13 @@ BOOL WSACloseEvent(WSAEVENT hEvent) {
     detail::fail(WSA_INVALID_HANDLE);
     return 0;
   }
-  // A wait that still holds the object keeps it alive; it just never fires.
+  // A wait that still holds the object keeps it alive; it just never fires,
+  // and the next wait of that thread resolves its handles anew.
   std::lock_guard<std::mutex> hold(detail::eventLock());
   event->socket.reset();
+  detail::relinkLocked(*event);
+  for (detail::WaitEntry* waiter = event->waiters; waiter != nullptr; waiter = waiter->nextWaiter)
+    waiter->set->noteClosed();
   return 1;
 }
 

@@ -1,5 +1,6 @@
-// WSAEventSelect and WSAEnumNetworkEvents: turning poll readiness into
-// Winsock's network-event record, with its re-enabling rules.
+// WSAEventSelect and WSAEnumNetworkEvents: turning readiness into Winsock's
+// network-event record, with its re-enabling rules, and what a socket waits
+// for under those rules.
 #include "internal.h"  // first: see the note there
 #include "syscalls.h"
 
@@ -163,12 +164,18 @@ int WSAEventSelect(SOCKET s, WSAEVENT hEventObject, long lNetworkEvents) {
     event = detail::findEvent(hEventObject);
     if (!event) return detail::fail(WSA_INVALID_HANDLE);
   }
-  std::lock_guard<std::mutex> hold(socket->lock);
+  detail::SocketGuard hold(*socket);
   if (socket->closed) return detail::fail(WSAENOTSOCK);
   {
     std::lock_guard<std::mutex> events(detail::eventLock());
-    if (socket->event && socket->event->socket.lock() == socket) socket->event->socket.reset();
-    if (event) event->socket = socket;
+    if (socket->event && socket->event->socket.lock() == socket) {
+      socket->event->socket.reset();
+      detail::relinkLocked(*socket->event);
+    }
+    if (event) {
+      event->socket = socket;
+      detail::relinkLocked(*event);
+    }
   }
   // A new selection starts a new record.
   socket->event = event;
@@ -186,7 +193,7 @@ int WSAEnumNetworkEvents(SOCKET s, WSAEVENT hEventObject, WSANETWORKEVENTS* lpNe
   if (!socket) return detail::fail(WSAENOTSOCK);
   if (lpNetworkEvents == nullptr) return detail::fail(WSAEFAULT);
   std::shared_ptr<detail::EventObject> event = hEventObject ? detail::findEvent(hEventObject) : nullptr;
-  std::lock_guard<std::mutex> hold(socket->lock);
+  detail::SocketGuard hold(*socket);
   // The waits record what poll reports; look at the socket here only when
   // nothing is recorded yet (a caller that enumerates without waiting).
   if ((socket->recorded & socket->selected) == 0) detail::refresh(*socket);

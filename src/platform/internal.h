@@ -13,6 +13,7 @@
 #include <memory>
 #include <mutex>
 #include <string>
+#include <unordered_map>
 #include <vector>
 
 #include "fault.h"
@@ -147,9 +148,121 @@ struct Completion {
   DWORD flags;
 };
 
+struct EventObject;
+struct SocketState;
+class Reactor;
+class WaitSet;
+
+// A socket with operations of the thread under way, registered with its wait
+// set while they last.
+struct IoSocket {
+  std::shared_ptr<SocketState> socket;
+  bool registered = false;
+};
+
+// One distinct event of a thread's last wait. Other threads reach it through
+// EventObject::waiters, and touch its flags under the event lock only.
+struct WaitEntry {
+  WaitSet* set;
+  std::shared_ptr<EventObject> event;
+  WaitEntry* prevWaiter = nullptr;  // the event's other waiters (event lock)
+  WaitEntry* nextWaiter = nullptr;
+  bool linked = false;     // among the event's waiters
+  bool candidate = false;  // on the set's list of events signalled since it looked
+  bool relink = false;     // on the set's list of events whose socket changed
+  // Owner only.
+  DWORD index = 0;  // the lowest index of the event in the wait's array
+  DWORD nextIndex = 0;
+  unsigned epoch = 0;                   // the last array that named it
+  std::shared_ptr<SocketState> socket;  // the linked socket it keeps registered
+};
+
+// What a thread's waits keep from one wait to the next, so that a wait over
+// the same handles as the last one costs nothing in their number: the last
+// array and its events (each knowing this set as a waiter), and an epoll
+// descriptor with the sockets of those events and of the thread's own
+// operations registered, each with what it waits for now. A socket changes
+// its registration itself when what it waits for changes (syncInterest), and
+// a signalled event puts itself on a short list, so a wait looks at what
+// changed only. Owner thread only, but where noted.
+class WaitSet {
+ public:
+  explicit WaitSet(Reactor& owner) : owner_(owner) {}
+  ~WaitSet() { close(); }
+  WaitSet(const WaitSet&) = delete;
+  WaitSet& operator=(const WaitSet&) = delete;
+
+  // The epoll descriptor, made if it doesn't exist yet; false (the Winsock
+  // error set) while the system refuses one.
+  bool ready();
+  // Makes `handles` the events of the waits from now on; nothing to do when
+  // they are the last wait's. False (the Winsock error set) on a closed
+  // handle or when memory runs out; the set is then as it was.
+  bool use(DWORD count, const WSAEVENT* handles);
+  // Follows what changed since the last look: sockets linked to or unlinked
+  // from the events, the thread's own operations, registrations that the
+  // system refused. False (the Winsock error set) if it still refuses one.
+  bool settle(std::vector<IoSocket>& io);
+  // Hands the queued sends of the thread's operations to the kernel, and
+  // lets go of sockets that have nothing under way any more.
+  void flush(std::vector<IoSocket>& io);
+  // The lowest index of a signalled event, or -1 when there is none and the
+  // thread may sleep, or kSettle when something changed since settle().
+  static constexpr long kSettle = -2;
+  long arm(bool events);
+  // The lowest index of a signalled event, -1 if none (event lock held).
+  long lowestSignalled();
+  // Sleeps in epoll_wait for at most `timeout` ms (-1: no limit) and serves
+  // what it reports; false with errno set if the wait failed.
+  bool sleep(int timeout);
+  // Drops every registration and the descriptor (the thread ends).
+  void close();
+  // Whether a wait of this set's descriptor was made before this process
+  // forked: a child must never change a descriptor it shares with its parent.
+  bool inherited() const;
+  // Changes the socket's registration with `id` from the events `had` to
+  // `want`; false if the system refused.
+  bool control(int fd, std::uint64_t id, std::uint32_t had, std::uint32_t want);
+
+  // Any thread, event lock held.
+  void noteSignalled(WaitEntry& entry);
+  void noteRelink(WaitEntry& entry);
+  void noteClosed() { stale_ = true; }
+  void noteRefused();  // the socket's Watch says which registration
+
+ private:
+  struct Registration {
+    std::shared_ptr<SocketState> socket;
+    std::uint64_t id;
+    int refs;  // events linked to it, and the thread's operations
+  };
+  bool ref(const std::shared_ptr<SocketState>& socket);
+  void unref(SocketState* socket);
+  // Lets go of every event and socket, without a word to the kernel.
+  void forget();
+
+  Reactor& owner_;
+  int epoll_ = -1;
+  unsigned generation_ = 0;  // the process's fork count when epoll_ was made
+  std::vector<WSAEVENT> handles_;
+  std::unordered_map<std::uint64_t, std::unique_ptr<WaitEntry>> entries_;  // by handle
+  std::unordered_map<SocketState*, Registration> sockets_;
+  std::unordered_map<std::uint64_t, SocketState*> ids_;  // what epoll names
+  std::uint64_t nextId_ = 1;                             // 0 names the wake-up descriptor
+  unsigned epoch_ = 0;
+  std::vector<SocketState*> released_;
+  // Guarded by the event lock.
+  std::vector<WaitEntry*> signalled_;
+  std::vector<WaitEntry*> relinks_;
+  bool sleeping_ = false;
+  std::atomic<bool> stale_{false};    // an event of the last wait was closed: resolve anew
+  std::atomic<bool> refused_{false};  // a registration was refused: apply it again
+};
+
 // Every thread that issues overlapped I/O or waits owns one reactor: its queue
-// of finished operations, and an eventfd that other threads write to wake its
-// wait. Completion routines run only from the owner's alertable waits.
+// of finished operations, an eventfd that other threads write to wake its
+// wait, and the wait's registrations. Completion routines run only from the
+// owner's alertable waits.
 class Reactor {
  public:
   Reactor();
@@ -168,15 +281,16 @@ class Reactor {
   // Owner only. Runs every queued completion in order; true if any ran.
   bool runCompletions();
   bool hasCompletions();
-  // Any thread: make the owner's current or next poll return.
+  // Any thread: make the owner's current or next wait return.
   void wake();
-  // Owner only: clears pending wake-ups after a poll.
+  // Owner only: clears pending wake-ups after a wait.
   void drainWake();
   int wakeFd() const { return wakeFd_; }
 
   // Sockets on which this thread has operations under way (owner only).
-  std::vector<std::shared_ptr<struct SocketState>> ioSockets;
-  void watch(const std::shared_ptr<struct SocketState>& socket);
+  std::vector<IoSocket> ioSockets;
+  void watch(const std::shared_ptr<SocketState>& socket);
+  WaitSet waits{*this};
 
  private:
   std::atomic<int> wakeFd_{-1};
@@ -191,14 +305,16 @@ class Reactor {
 // global event lock; lock order is socket lock, then event lock.
 struct EventObject {
   bool signalled = false;
-  std::vector<Reactor*> waiters;
-  std::weak_ptr<struct SocketState> socket;  // set by WSAEventSelect
+  WaitEntry* waiters = nullptr;       // of the wait sets that hold it, linked through the entries
+  std::weak_ptr<SocketState> socket;  // set by WSAEventSelect
 };
 
 std::mutex& eventLock();
 std::shared_ptr<EventObject> findEvent(WSAEVENT handle);
 // Signals with the event lock held by the caller.
 void signalLocked(EventObject& event);
+// Tells the event's waiters that its socket changed (event lock held).
+void relinkLocked(EventObject& event);
 
 // ---- Sockets ----------------------------------------------------------------
 
@@ -243,6 +359,37 @@ struct SocketState {
   std::deque<Operation*> receives;
   std::size_t unflushed = 0;  // bytes of `sends` not yet taken by the kernel
   bool sendBlocked = false;   // the kernel refused; wait for POLLOUT
+
+  // The wait sets that hold the socket registered, each under its own id,
+  // and the epoll events registered with all of them: what pollInterest gave
+  // at the last release of `lock` (0: left out of their descriptors).
+  struct Watch {
+    WaitSet* set;
+    std::uint64_t id;
+    bool refused;  // the set's descriptor refused the last change
+  };
+  std::vector<Watch> watches;
+  std::uint32_t interest = 0;
+};
+
+// Brings the socket's registration in every wait set in line with what it
+// waits for now (socket lock held).
+void syncInterest(SocketState& socket);
+
+// Holds a socket's lock; every change of the socket's state is made under
+// it, and its release follows the change in the wait sets.
+class SocketGuard {
+ public:
+  explicit SocketGuard(SocketState& socket) : socket_(socket) { socket_.lock.lock(); }
+  ~SocketGuard() {
+    syncInterest(socket_);
+    socket_.lock.unlock();
+  }
+  SocketGuard(const SocketGuard&) = delete;
+  SocketGuard& operator=(const SocketGuard&) = delete;
+
+ private:
+  SocketState& socket_;
 };
 
 std::shared_ptr<SocketState> findSocket(SOCKET s);
@@ -261,16 +408,18 @@ void progressSends(SocketState& socket);
 void progressReceives(SocketState& socket);
 // Ends every queued operation with `error` (socket lock held).
 void abortOperations(SocketState& socket, DWORD error);
-// Flushes what the kernel takes without blocking, aborts the rest and closes
-// the descriptor (socket lock held).
+// Flushes what the kernel takes without blocking, aborts the rest, takes the
+// socket out of the wait sets and closes the descriptor (socket lock held).
 void closeLocked(SocketState& socket);
 // A zero-timeout poll of one socket, then recordReadiness (socket lock held).
 void refresh(SocketState& socket);
 
 // ---- Waiting ----------------------------------------------------------------
 
-// The wait behind WSAWaitForMultipleEvents and SleepEx.
-DWORD waitForEvents(DWORD count, const WSAEVENT* events, DWORD milliseconds, bool alertable);
+// The wait behind waitForAnyEvent, WSAWaitForMultipleEvents and SleepEx: with
+// no events, it waits for completions only. A signalled event gives
+// WSA_WAIT_EVENT_0 and its lowest index in `index`.
+DWORD waitForEvents(DWORD count, const WSAEVENT* events, DWORD milliseconds, bool alertable, DWORD& index);
 
 }  // namespace platform::detail
 

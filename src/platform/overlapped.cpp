@@ -226,7 +226,7 @@ int WSASend(SOCKET s, WSABUF* lpBuffers, DWORD dwBufferCount, DWORD* lpNumberOfB
   if (faulted) {
     if (result == WSAEWOULDBLOCK) {
       // A refused send arms FD_WRITE, as a full send buffer would.
-      std::lock_guard<std::mutex> hold(socket->lock);
+      detail::SocketGuard hold(*socket);
       socket->writeEnabled = true;
       detail::refresh(*socket);
       return detail::fail(WSAEWOULDBLOCK);
@@ -238,7 +238,7 @@ int WSASend(SOCKET s, WSABUF* lpBuffers, DWORD dwBufferCount, DWORD* lpNumberOfB
   if (lpOverlapped == nullptr || lpCompletionRoutine == nullptr) return detail::fail(WSAEINVAL);
   // Completions come back through this thread's reactor.
   if (!detail::Reactor::current()->ready()) return SOCKET_ERROR;
-  std::lock_guard<std::mutex> hold(socket->lock);
+  detail::SocketGuard hold(*socket);
   if (socket->closed) return detail::fail(WSAENOTSOCK);
   if (socket->type == wsa::sockStream) {
     if (socket->phase == detail::Phase::Connecting) detail::refresh(*socket);
@@ -265,7 +265,7 @@ int WSARecv(SOCKET s, WSABUF* lpBuffers, DWORD dwBufferCount, DWORD* lpNumberOfB
   if (lpOverlapped == nullptr || lpCompletionRoutine == nullptr) return detail::fail(WSAEINVAL);
   // Completions come back through this thread's reactor.
   if (!detail::Reactor::current()->ready()) return SOCKET_ERROR;
-  std::lock_guard<std::mutex> hold(socket->lock);
+  detail::SocketGuard hold(*socket);
   if (socket->closed) return detail::fail(WSAENOTSOCK);
   // Posting a read re-enables FD_READ, whatever comes of it.
   socket->readEnabled = true;

@@ -31,12 +31,18 @@ thread_local Reactor* t_self = nullptr;
 }  // namespace
 
 const std::shared_ptr<Reactor>& Reactor::current() {
-  thread_local std::shared_ptr<Reactor> reactor = [] {
-    auto r = std::make_shared<Reactor>();
-    t_self = r.get();
-    return r;
-  }();
-  return reactor;
+  // The wait set lets go of its events and sockets on its own thread, as
+  // that thread ends; the reactor itself may live on in operations that
+  // still name it.
+  thread_local struct Holder {
+    std::shared_ptr<Reactor> reactor = [] {
+      auto r = std::make_shared<Reactor>();
+      t_self = r.get();
+      return r;
+    }();
+    ~Holder() { reactor->waits.close(); }
+  } holder;
+  return holder.reactor;
 }
 
 void Reactor::post(const Completion& completion) {
@@ -81,7 +87,8 @@ void Reactor::drainWake() {
 }
 
 void Reactor::watch(const std::shared_ptr<SocketState>& socket) {
-  if (std::find(ioSockets.begin(), ioSockets.end(), socket) == ioSockets.end()) ioSockets.push_back(socket);
+  auto same = [&](const IoSocket& mine) { return mine.socket == socket; };
+  if (std::none_of(ioSockets.begin(), ioSockets.end(), same)) ioSockets.push_back({socket, false});
 }
 
 }  // namespace platform::detail

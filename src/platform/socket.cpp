@@ -61,13 +61,23 @@ void closeLocked(SocketState& socket) {
   socket.closed = true;
   if (socket.event) {
     std::lock_guard<std::mutex> hold(eventLock());
-    if (socket.event->socket.lock().get() == &socket) socket.event->socket.reset();
+    if (socket.event->socket.lock().get() == &socket) {
+      socket.event->socket.reset();
+      relinkLocked(*socket.event);
+    }
   }
   socket.event.reset();
   socket.selected = 0;
-  // A listening socket stops listening now: a wait on another thread may
-  // still hold the descriptor in its poll, and close alone would keep the
-  // port bound until that poll returns, failing a new listener's bind.
+  // Out of every wait set's descriptor before the number can be reused; a
+  // refusal doesn't matter, as the close below takes it out too.
+  for (const SocketState::Watch& watch : socket.watches)
+    if ((socket.interest != 0 || watch.refused) && socket.fd >= 0)
+      watch.set->control(socket.fd, watch.id, watch.refused ? ~0u : socket.interest, 0);
+  socket.watches.clear();
+  socket.interest = 0;
+  // A listening socket stops listening now: close alone would keep the port
+  // bound while another process shares the descriptor (a child between its
+  // fork and its exec), failing a new listener's bind.
   if (socket.phase == Phase::Listening && socket.fd >= 0) ::shutdown(socket.fd, SHUT_RDWR);
   if (socket.fd >= 0) ::close(socket.fd);
   socket.fd = -1;
@@ -136,7 +146,7 @@ int closesocket(SOCKET s) {
   std::shared_ptr<detail::SocketState> socket = detail::socketTable().remove(s);
   if (!socket) return fail(WSAENOTSOCK);
   {
-    std::lock_guard<std::mutex> hold(socket->lock);
+    detail::SocketGuard hold(*socket);
     detail::closeLocked(*socket);
   }
   // Like a failing close(2), a refused closesocket still releases the socket.
@@ -150,7 +160,7 @@ int bind(SOCKET s, const sockaddr* name, int namelen) {
   if (!socket) return fail(WSAENOTSOCK);
   ::sockaddr_in address;
   if (!detail::toLinux(name, namelen, address)) return fail(WSAEFAULT);
-  std::lock_guard<std::mutex> hold(socket->lock);
+  detail::SocketGuard hold(*socket);
   if (::bind(socket->fd, reinterpret_cast<const ::sockaddr*>(&address), sizeof address) != 0)
     return failFromErrno(errno);
   return 0;
@@ -161,7 +171,7 @@ int listen(SOCKET s, int backlog) {
   if (fault::check(fault::Call::listen, result)) return fail(result);
   std::shared_ptr<detail::SocketState> socket = detail::findSocket(s);
   if (!socket) return fail(WSAENOTSOCK);
-  std::lock_guard<std::mutex> hold(socket->lock);
+  detail::SocketGuard hold(*socket);
   if (socket->type != wsa::sockStream) return fail(WSAEOPNOTSUPP);
   if (::listen(socket->fd, backlog) != 0) return failFromErrno(errno);
   socket->phase = detail::Phase::Listening;
@@ -177,7 +187,7 @@ int getsockname(SOCKET s, sockaddr* name, int* namelen) {
   if (!socket) return fail(WSAENOTSOCK);
   ::sockaddr_in address{};
   socklen_t length = sizeof address;
-  std::lock_guard<std::mutex> hold(socket->lock);
+  detail::SocketGuard hold(*socket);
   if (::getsockname(socket->fd, reinterpret_cast<::sockaddr*>(&address), &length) != 0)
     return failFromErrno(errno);
   return detail::fromLinux(address, name, namelen);
@@ -188,7 +198,7 @@ int getpeername(SOCKET s, sockaddr* name, int* namelen) {
   if (!socket) return fail(WSAENOTSOCK);
   ::sockaddr_in address{};
   socklen_t length = sizeof address;
-  std::lock_guard<std::mutex> hold(socket->lock);
+  detail::SocketGuard hold(*socket);
   if (::getpeername(socket->fd, reinterpret_cast<::sockaddr*>(&address), &length) != 0)
     return failFromErrno(errno);
   return detail::fromLinux(address, name, namelen);
@@ -223,7 +233,7 @@ int setsockopt(SOCKET s, int level, int optname, const char* optval, int optlen)
   } else {
     return fail(WSAENOPROTOOPT);
   }
-  std::lock_guard<std::mutex> hold(socket->lock);
+  detail::SocketGuard hold(*socket);
   if (::setsockopt(socket->fd, linuxLevel, linuxOption, &value, sizeof value) != 0)
     return failFromErrno(errno);
   if (level == wsa::solSocket && optname == wsa::soSndBuf) socket->sendBuffer = value;
@@ -238,7 +248,7 @@ int getsockopt(SOCKET s, int level, int optname, char* optval, int* optlen) {
   if (!socket) return fail(WSAENOTSOCK);
   if (optval == nullptr || optlen == nullptr || *optlen < static_cast<int>(sizeof(int))) return fail(WSAEFAULT);
   if (level != wsa::solSocket) return fail(WSAENOPROTOOPT);
-  std::lock_guard<std::mutex> hold(socket->lock);
+  detail::SocketGuard hold(*socket);
   int value;
   if (optname == wsa::soSndBuf) {
     // Linux reports twice what was set (its bookkeeping overhead); Winsock
@@ -274,7 +284,7 @@ int WSAConnect(SOCKET s, const sockaddr* name, int namelen, WSABUF*, WSABUF*, QO
   if (!socket) return fail(WSAENOTSOCK);
   ::sockaddr_in address;
   if (!detail::toLinux(name, namelen, address)) return fail(WSAEFAULT);
-  std::lock_guard<std::mutex> hold(socket->lock);
+  detail::SocketGuard hold(*socket);
   int rc = ::connect(socket->fd, reinterpret_cast<const ::sockaddr*>(&address), sizeof address);
   int err = rc == 0 ? 0 : errno;
   if (socket->type == wsa::sockDgram) {
@@ -314,7 +324,7 @@ SOCKET WSAAccept(SOCKET s, sockaddr* addr, int* addrlen, LPCONDITIONPROC lpfnCon
   }
   int result = 0;
   bool faulted = fault::check(fault::Call::WSAAccept, result);
-  std::lock_guard<std::mutex> hold(listener->lock);
+  detail::SocketGuard hold(*listener);
   // Any accept call re-enables FD_ACCEPT; a connection still waiting records
   // it again at the next look.
   listener->acceptEnabled = true;
@@ -352,7 +362,7 @@ int WSASendDisconnect(SOCKET s, WSABUF*) {
   if (fault::check(fault::Call::WSASendDisconnect, result)) return fail(result);
   std::shared_ptr<detail::SocketState> socket = detail::findSocket(s);
   if (!socket) return fail(WSAENOTSOCK);
-  std::lock_guard<std::mutex> hold(socket->lock);
+  detail::SocketGuard hold(*socket);
   if (socket->type != wsa::sockStream || socket->phase != detail::Phase::Connected) return fail(WSAENOTCONN);
   socket->shutWrite = true;
   // Sends already accepted go out before the FIN: if some are still queued,

@@ -70,7 +70,7 @@ int WSACleanup() {
   if (now == 1) {
     for (auto& [handle, socket] : detail::socketTable().removeAll()) {
       (void)handle;
-      std::lock_guard<std::mutex> hold(socket->lock);
+      detail::SocketGuard hold(*socket);
       detail::closeLocked(*socket);
     }
   }

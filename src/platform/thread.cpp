@@ -66,7 +66,8 @@ DWORD SleepEx(DWORD dwMilliseconds, BOOL bAlertable) {
     Sleep(dwMilliseconds);
     return 0;
   }
-  DWORD result = detail::waitForEvents(0, nullptr, dwMilliseconds, true);
+  DWORD index = 0;
+  DWORD result = detail::waitForEvents(0, nullptr, dwMilliseconds, true, index);
   return result == WSA_WAIT_IO_COMPLETION ? WSA_WAIT_IO_COMPLETION : 0;
 }
 

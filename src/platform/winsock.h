@@ -154,6 +154,7 @@ constexpr long FD_CLOSE = 1 << FD_CLOSE_BIT;
 
 // Waits.
 constexpr DWORD WSA_MAXIMUM_WAIT_EVENTS = 64;
+constexpr DWORD LARGEST_WAIT_EVENTS = 65536;  // of waitForAnyEvent
 constexpr DWORD WSA_INFINITE = 0xFFFFFFFFu;
 constexpr DWORD WSA_WAIT_EVENT_0 = 0;
 constexpr DWORD WSA_WAIT_IO_COMPLETION = 192;
@@ -190,6 +191,15 @@ BOOL WSASetEvent(WSAEVENT hEvent);
 BOOL WSAResetEvent(WSAEVENT hEvent);
 DWORD WSAWaitForMultipleEvents(DWORD cEvents, const WSAEVENT* lphEvents, BOOL fWaitAll,
                                DWORD dwTimeout, BOOL fAlertable);
+// Not Winsock's: WSAWaitForMultipleEvents without its limit of 64 events (up
+// to LARGEST_WAIT_EVENTS), for any one of them. A signalled event gives
+// WSA_WAIT_EVENT_0 with the lowest signalled index in *lpdwIndex, since an
+// index of 192 or 258 could not be told from WSA_WAIT_IO_COMPLETION or
+// WSA_WAIT_TIMEOUT; the other results are those of WSAWaitForMultipleEvents.
+// A wait over the same events as the thread's last one costs nothing in
+// their number.
+DWORD waitForAnyEvent(DWORD cEvents, const WSAEVENT* lphEvents, DWORD dwTimeout, BOOL fAlertable,
+                      DWORD* lpdwIndex);
 
 // Sockets.
 SOCKET WSASocketA(int af, int type, int protocol, const WSAPROTOCOL_INFOA* lpProtocolInfo,

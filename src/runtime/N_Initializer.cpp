@@ -1,5 +1,7 @@
 #include "N_Initializer.h"
 
+#include <algorithm>
+
 #include "N_Address.h"
 #include "N_Listener.h"
 #include "N_Socket.h"
@@ -15,7 +17,6 @@ namespace {
 
 const char kNetworkMutexName[] = "Kelvane network mutex";
 constexpr platform::WORD kWinsockVersion = 0x0002;  // 2.0
-constexpr platform::DWORD kMaximumWaitEvents = 64;
 // How long the start waits for the local host's identifier.
 constexpr float kLocalAddressSeconds = 10.0f;
 
@@ -41,6 +42,11 @@ void deleteRegistered(Q_DLList<T*>*& list) {
   Q_Delete(list);
   list = nullptr;
 }
+
+// The wait set's size for the next start, and the one in force (0 while no
+// runtime runs).
+std::atomic<platform::DWORD> g_waitEventsSet{platform::WSA_MAXIMUM_WAIT_EVENTS};
+std::atomic<platform::DWORD> g_waitEventsInForce{0};
 
 // Frees the buffers the records of a queue still own, then the queue.
 void deleteQueue(Q_DLList<N_Socket::DataQueue>*& queue) {
@@ -69,6 +75,8 @@ platform::WSAPROTOCOL_INFOA* N_Initializer::m_tcpProtocol = nullptr;
 platform::WSAPROTOCOL_INFOA* N_Initializer::m_udpProtocol = nullptr;
 platform::HANDLE N_Initializer::m_hMutex = nullptr;
 platform::WSAEVENT N_Initializer::m_eventRelease = nullptr;
+platform::WSAEVENT* N_Initializer::m_pWaitEvents = nullptr;
+platform::DWORD N_Initializer::m_uWaitEvents = 0;
 N_Address* N_Initializer::m_pLocalAddress = nullptr;
 Q_DLList<N_Socket*>* N_Initializer::m_pSockets = nullptr;
 Q_DLList<N_Listener*>* N_Initializer::m_pListeners = nullptr;
@@ -154,6 +162,11 @@ void N_Initializer::start() {
   if (m_udpProtocol == nullptr) Q_Throw<N_NetException_NoUDP>();
 
   m_eventRelease = platform::WSACreateEvent();
+  // Once for the thread's life, never per pass: at the larger sizes the set
+  // is too big for the thread's stack.
+  m_uWaitEvents = g_waitEventsSet.load();
+  m_pWaitEvents = Q_NewArray<platform::WSAEVENT>(m_uWaitEvents);
+  g_waitEventsInForce.store(m_uWaitEvents);
 
   // The thread writes THREAD_RUNNING once, without looking; waiting for that
   // write here means no stop can be overwritten by it.
@@ -231,6 +244,10 @@ void N_Initializer::stop() {
   m_pPumpFrom = nullptr;
   m_uBytesWaitingForSend = 0;
 
+  Q_DeleteArray(m_pWaitEvents);
+  m_pWaitEvents = nullptr;
+  g_waitEventsInForce.store(0);
+
   platform::WSACloseEvent(m_eventRelease);
   platform::CloseHandle(m_hMutex);
   m_hMutex = nullptr;
@@ -253,6 +270,16 @@ N_RuntimeStats N_Initializer::getStatistics() {
 
 void N_Initializer::releaseThreadLoop() { platform::WSASetEvent(m_eventRelease); }
 
+void N_Initializer::setMaximumWaitEvents(unsigned uMaximumWaitEvents) {
+  g_waitEventsSet.store(std::clamp<platform::DWORD>(uMaximumWaitEvents, platform::WSA_MAXIMUM_WAIT_EVENTS,
+                                                    platform::LARGEST_WAIT_EVENTS));
+}
+
+unsigned N_Initializer::getMaximumWaitEvents() {
+  const platform::DWORD inForce = g_waitEventsInForce.load();
+  return inForce != 0 ? inForce : g_waitEventsSet.load();
+}
+
 int N_Initializer::acceptConnection(platform::WSABUF*, platform::WSABUF*, platform::_QualityOfService*,
                                     platform::_QualityOfService*, platform::WSABUF*, platform::WSABUF*, platform::UINT*,
                                     std::uintptr_t) {
@@ -265,14 +292,14 @@ unsigned int N_Initializer::threadNetwork(void*) {
   MutexHold hold(m_hMutex);
   m_threadState.store(THREAD_RUNNING);
 
-  platform::WSAEVENT events[kMaximumWaitEvents];
+  platform::WSAEVENT* const events = m_pWaitEvents;
   int failedWaits = 0;
   while (m_threadState.load() == THREAD_RUNNING) {
     platform::DWORD count = 1;
     platform::DWORD timeout = platform::WSA_INFINITE;
     events[0] = m_eventRelease;
     try {
-      count = buildWaitSet(events, timeout);
+      count = buildWaitSet(timeout);
       resumeReads();
       pumpSends();
     } catch (...) {
@@ -282,8 +309,10 @@ unsigned int N_Initializer::threadNetwork(void*) {
     hold.unlock();
 
     // Completion routines run inside this wait and take the mutex themselves.
-    platform::DWORD result =
-        platform::WSAWaitForMultipleEvents(count, events, platform::FALSE, timeout, platform::TRUE);
+    // Winsock's wait for any of the events, without its limit of 64: the
+    // index comes apart from the result, so none can pass for another result.
+    platform::DWORD index = 0;
+    platform::DWORD result = platform::waitForAnyEvent(count, events, timeout, platform::TRUE, &index);
     if (m_threadState.load() != THREAD_RUNNING) break;
 
     // A wait that keeps failing (a broken release event, say) must not turn
@@ -296,14 +325,14 @@ unsigned int N_Initializer::threadNetwork(void*) {
     }
 
     hold.lock();
-    if (result == platform::WSA_WAIT_EVENT_0) {
+    if (result != platform::WSA_WAIT_EVENT_0) {
+      // Failed, completions ran or a rest ended: nothing to serve; the next
+      // pass builds the wait set anew.
+    } else if (index == 0) {
       platform::WSAResetEvent(events[0]);
-    } else if (result == platform::WSA_WAIT_FAILED || result == platform::WSA_WAIT_IO_COMPLETION ||
-               result == platform::WSA_WAIT_TIMEOUT) {
-      // Nothing to serve; the next pass builds the wait set anew.
-    } else if (result < count) {
+    } else if (index < count) {
       try {
-        serveEvent(events[result]);
+        serveEvent(events[index]);
       } catch (...) {
         // An allocation that failed while serving costs that event only.
         traceSwallowed("network event");

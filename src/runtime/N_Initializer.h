@@ -41,8 +41,8 @@
 ///
 /// @par Threads
 /// Constructors and destructors of N_Initializer must not run at the same time
-/// on different threads. setLimits() and getLimits() may be called from any
-/// thread.
+/// on different threads. setLimits(), getLimits(), setMaximumWaitEvents() and
+/// getMaximumWaitEvents() may be called from any thread.
 #pragma once
 
 #include <atomic>
@@ -108,6 +108,28 @@ class VARDEL_API N_Initializer {
   /// N_Initializer lives.
   static N_RuntimeStats getStatistics();
 
+  /// Sets how many objects the network thread waits on at once: the size of
+  /// its wait set, its release event included. Sockets take their places
+  /// oldest first, then listeners (with N_Limits::bListenersFirst the other
+  /// way round); what doesn't fit isn't served until others go, though its
+  /// sends still leave. The default, 64, is Winsock's limit, and with it an
+  /// N_Server holds (64 - 3) / 3 = 20 clients: each client is three sockets,
+  /// beside the server's two listeners. A larger size holds more: 604 for 200
+  /// clients, 4096 for 1364.
+  ///
+  /// Values below 64 are taken as 64, values above 65536 as 65536. The size
+  /// is read when the runtime starts (the first N_Initializer): a call while
+  /// it runs changes the next start only. The wait set is allocated once, at
+  /// that start, and the thread's wait costs the same whatever its size; its
+  /// passes walk the sockets and listeners, as they do at any size. Every
+  /// connection is a descriptor: a server of many clients may need a higher
+  /// descriptor limit (`ulimit -n`) as well.
+  static void setMaximumWaitEvents(unsigned uMaximumWaitEvents);
+  /// The size of the wait set: while the runtime runs the one it started
+  /// with, otherwise the one its next start takes (64 until
+  /// setMaximumWaitEvents()).
+  static unsigned getMaximumWaitEvents();
+
  private:
   friend class Runtime;  // the owner of the shared state below
 
@@ -128,10 +150,11 @@ class VARDEL_API N_Initializer {
                               platform::UINT* group, std::uintptr_t callbackData);
 
   // One pass of the network thread, with m_hMutex held (network_pass.cpp).
-  // Fills events[0..count) with the release event first and returns count.
+  // Fills m_pWaitEvents[0..count) with the release event first and returns
+  // count (at most m_uWaitEvents).
   // A listener resting after a failed accept is left out; `timeout` is set
   // to the milliseconds until the first of them may come back (or INFINITE).
-  static platform::DWORD buildWaitSet(platform::WSAEVENT* events, platform::DWORD& timeout);
+  static platform::DWORD buildWaitSet(platform::DWORD& timeout);
   // Posts the reads of sockets whose receive backlog has fallen below its
   // bound since their reading paused.
   static void resumeReads();
@@ -158,6 +181,10 @@ class VARDEL_API N_Initializer {
   static platform::WSAPROTOCOL_INFOA* m_udpProtocol;
   static platform::HANDLE m_hMutex;          // "Kelvane network mutex", recursive
   static platform::WSAEVENT m_eventRelease;  // slot 0 of every wait set
+  // The network thread's wait set, allocated by the start with the size then
+  // set (owned; written before the thread starts, then its own).
+  static platform::WSAEVENT* m_pWaitEvents;
+  static platform::DWORD m_uWaitEvents;
   static N_Address* m_pLocalAddress;         // owned
 
   static Q_DLList<N_Socket*>* m_pSockets;

@@ -13,14 +13,15 @@
 #include "win32.h"
 #include "winsock.h"
 
-platform::DWORD N_Initializer::buildWaitSet(platform::WSAEVENT* events, platform::DWORD& timeout) {
+platform::DWORD N_Initializer::buildWaitSet(platform::DWORD& timeout) {
+  platform::WSAEVENT* const events = m_pWaitEvents;
   const N_Limits limits = getLimits();
   const bool listenersFirst = limits.bListenersFirst;
   platform::DWORD count = 0;
   timeout = platform::WSA_INFINITE;
   events[count++] = m_eventRelease;
   auto addListeners = [&] {
-    for (N_Listener** slot = m_pListeners->getFirst(); slot != nullptr && count < platform::WSA_MAXIMUM_WAIT_EVENTS;
+    for (N_Listener** slot = m_pListeners->getFirst(); slot != nullptr && count < m_uWaitEvents;
          slot = m_pListeners->getNext(slot)) {
       N_Listener* listener = *slot;
       if (listener == nullptr) continue;
@@ -37,11 +38,11 @@ platform::DWORD N_Initializer::buildWaitSet(platform::WSAEVENT* events, platform
       events[count++] = listener->m_event;
     }
   };
-  // By default sockets come first: with 63 sockets or more no listener is
-  // waited on. The lists keep their order, so the same objects stay out
-  // until others go.
+  // By default sockets come first: with 63 sockets or more (at the default
+  // size of 64) no listener is waited on. The lists keep their order, so the
+  // same objects stay out until others go.
   if (listenersFirst) addListeners();
-  for (N_Socket** slot = m_pSockets->getFirst(); slot != nullptr && count < platform::WSA_MAXIMUM_WAIT_EVENTS;
+  for (N_Socket** slot = m_pSockets->getFirst(); slot != nullptr && count < m_uWaitEvents;
        slot = m_pSockets->getNext(slot))
     if (*slot != nullptr) events[count++] = (*slot)->m_event;
   if (!listenersFirst) addListeners();

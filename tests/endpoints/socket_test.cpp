@@ -1,9 +1,10 @@
 // Sockets and listeners through their public interface: construction and its
 // failures, connect and disconnect events, UDP, sockets destroyed while the
-// network thread works for them, the connect queue, the 64-event wait set;
-// and the packaged TCP stream, a 4-byte little-endian length and the payload,
-// which raw Linux peers read and write byte by byte (where the exact cut of a
-// read matters, the read is fed to the receive path directly).
+// network thread works for them, the connect queue, the wait set at its
+// default size of 64 events and beyond; and the packaged TCP stream, a 4-byte
+// little-endian length and the payload, which raw Linux peers read and write
+// byte by byte (where the exact cut of a read matters, the read is fed to the
+// receive path directly).
 #include <algorithm>
 #include <cstring>
 #include <filesystem>
@@ -311,20 +312,37 @@ TEST_F(SocketTest, AFullAcceptQueueWaitsForTheApplication) {
   }
 }
 
-// The network thread waits on at most 64 events: its release event, then
-// sockets oldest first, then listeners. What doesn't fit isn't served until
-// others go, but its sends still leave. With listeners first, none is left out.
-TEST_F(SocketTest, WaitSetServesSocketsFirstAndWhatDoesNotFitWaits) {
+// The network thread waits on at most 64 events by default: its release
+// event, then sockets oldest first, then listeners. What doesn't fit isn't
+// served until others go, but its sends still leave. A larger wait set
+// follows the same rule at its own size. With listeners first, none is left
+// out.
+class WaitSetTest : public EndpointTest, public ::testing::WithParamInterface<unsigned> {
+ protected:
+  void SetUp() override {
+    N_Initializer::setMaximumWaitEvents(GetParam());
+    EndpointTest::SetUp();
+  }
+  void TearDown() override {
+    EndpointTest::TearDown();
+    N_Initializer::setMaximumWaitEvents(64);
+  }
+};
+
+TEST_P(WaitSetTest, SocketsFirstAndWhatDoesNotFitWaits) {
+  const int size = static_cast<int>(GetParam());
+  N_Initializer::setMaximumWaitEvents(size + 1);
+  EXPECT_EQ(unsigned(size), N_Initializer::getMaximumWaitEvents()) << "the runtime keeps the size it started with";
   std::vector<std::unique_ptr<N_Socket>> sockets;
   auto addSockets = [&](int n) {
     while (n-- > 0) sockets.push_back(std::make_unique<N_Socket>(loopback(), freePort(), N_Socket::SOCKET_UDP));
   };
   std::vector<int> peers;
   auto knock = [&](int p) { peers.push_back(raw::connectTo("127.0.0.1", p)); };
-  addSockets(61);
+  addSockets(size - 3);
   const int portB = freePort();
   CountingListener first(port()), second(portB);
-  knock(port());  // 1 + 61 + 2 = 64: all served
+  knock(port());  // 1 + (size - 3) + 2 = size: all served
   knock(portB);
   EXPECT_TRUE(waitFor([&] { return first.calls == 1 && second.calls == 1; }));
   addSockets(1);  // the younger listener is out
@@ -352,6 +370,8 @@ TEST_F(SocketTest, WaitSetServesSocketsFirstAndWhatDoesNotFitWaits) {
   sockets.clear();
   for (int fd : peers) raw::closeFd(fd);
 }
+
+INSTANTIATE_TEST_SUITE_P(Size, WaitSetTest, ::testing::Values(64u, 300u));
 
 // Messages are exact on the wire, with the package and without; reads
 // without it are messages as they came, prefix-like bytes and all, an empty

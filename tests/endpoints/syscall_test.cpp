@@ -1,10 +1,11 @@
 // The system as it behaves on a busy host, through the table of Linux calls
 // under the platform layer: writes that take a few bytes, reads and waits
-// interrupted or refused for the moment, descriptors used up. The streams
-// must come through whole and in order, and what can't be made must fail the
-// way the matching Winsock error does, never end the process.
+// interrupted or refused for the moment, registrations with the wait refused,
+// descriptors used up. The streams must come through whole and in order, and
+// what can't be made must fail the way the matching Winsock error does, never
+// end the process.
 #include <netinet/in.h>
-#include <poll.h>
+#include <sys/epoll.h>
 #include <sys/socket.h>
 #include <sys/uio.h>
 
@@ -24,7 +25,7 @@
 namespace {
 
 // Calls of each kind so far: each fake goes through its own cycle.
-std::atomic<int> g_sends{0}, g_receives{0}, g_polls{0};
+std::atomic<int> g_sends{0}, g_receives{0}, g_polls{0}, g_registrations{0};
 
 // At most `limit` bytes of the message's buffers.
 msghdr cut(const msghdr* message, iovec* iov, std::size_t limit) {
@@ -77,9 +78,18 @@ long choppyRecvmsg(int fd, msghdr* message, int flags) {
 
 // A wait that wakes with nothing every other time (a look without waiting
 // still sees what is ready).
-int restlessPoll(pollfd* fds, unsigned long count, int timeout) {
+int restlessWait(int epfd, epoll_event* events, int count, int timeout) {
   if (timeout != 0 && g_polls++ % 2 == 0) return 0;
-  return ::poll(fds, count, timeout);
+  return ::epoll_wait(epfd, events, count, timeout);
+}
+
+// One change of a registration in five is refused for want of memory.
+int forgetfulRegistration(int epfd, int op, int fd, epoll_event* event) {
+  if (g_registrations++ % 5 == 4) {
+    errno = ENOMEM;
+    return -1;
+  }
+  return ::epoll_ctl(epfd, op, fd, event);
 }
 
 int noDescriptor(int, int, int) {
@@ -135,12 +145,14 @@ TEST_F(SyscallTest, StreamsComeThroughShortWritesInterruptionsAndRefusals) {
   ASSERT_TRUE(connectPair(listener, port(), d, c));
   platform::sys::calls().sendmsg = choppySendmsg;
   platform::sys::calls().recvmsg = choppyRecvmsg;
-  platform::sys::calls().poll = restlessPoll;
+  platform::sys::calls().epoll_wait = restlessWait;
+  platform::sys::calls().epoll_ctl = forgetfulRegistration;
   exchange(a, b, 40);
   exchange(c, d, 10);
   EXPECT_GT(g_sends.load(), 1000);  // the calls did go through the table
   EXPECT_GT(g_receives.load(), 1000);
   EXPECT_GT(g_polls.load(), 10);
+  EXPECT_GT(g_registrations.load(), 20);
   EXPECT_TRUE(a.isConnected() && b.isConnected() && c.isConnected() && d.isConnected());
 
   // Datagrams, to a plain socket on a host of its own and back.

@@ -300,6 +300,141 @@ TEST(Wait, GivesTheLowestSignalledIndexAndEventsStaySetUntilReset) {
   for (WSAEVENT h : e) WSACloseEvent(h);
 }
 
+// A UDP socket on 127.0.0.1 selected for FD_READ on `event`, and another
+// connected to it, whose sends go out at this thread's next alertable wait.
+struct DatagramPair {
+  SOCKET in = udpSocket(), out = udpSocket();
+  Record sent;
+  DatagramPair(WSAEVENT event) {
+    sockaddr_in a = loopback(0);
+    int length = sizeof a;
+    EXPECT_EQ(0, bind(in, asAddr(a), sizeof a));
+    EXPECT_EQ(0, getsockname(in, reinterpret_cast<sockaddr*>(&a), &length));
+    EXPECT_EQ(0, WSAConnect(out, asAddr(a), sizeof a, nullptr, nullptr, nullptr, nullptr));
+    EXPECT_EQ(0, WSAEventSelect(in, event, FD_READ));
+  }
+  ~DatagramPair() { closesocket(in), closesocket(out); }
+  void send() { EXPECT_EQ(0, post(true, out, "x", 1, sent)); }
+  void read() {  // takes the datagram and re-enables FD_READ
+    static char byte;
+    static Record r;
+    post(false, in, &byte, 1, r);
+  }
+};
+
+// Beyond Winsock's 64: a thousand events, UDP sockets' events from index 700
+// on. Indices of 192 and 258 are indices, not other results; the lowest
+// signalled one wins however the array changes between waits; a datagram
+// signals its socket's event, again after a read re-enabled it; another
+// thread's set wakes the wait; a handle closed between two waits over the
+// same array fails the second.
+TEST(Wait, AnyOfThousandsGivesTheLowestSignalledIndex) {
+  Winsock ws;
+  constexpr DWORD kCount = 1000, kFirstSocket = 700;
+  std::vector<WSAEVENT> e(kCount);
+  for (WSAEVENT& h : e) h = WSACreateEvent();
+  std::vector<std::unique_ptr<DatagramPair>> pairs;
+  for (DWORD i = kFirstSocket; i < kCount; ++i) pairs.push_back(std::make_unique<DatagramPair>(e[i]));
+  DatagramPair& at750 = *pairs[50];
+  DatagramPair& at900 = *pairs[200];
+  DWORD result = 0;
+  const auto wait = [&](const std::vector<WSAEVENT>& set, DWORD ms = 0) {
+    DWORD index = ~0u;
+    do result = waitForAnyEvent(static_cast<DWORD>(set.size()), set.data(), ms, TRUE, &index);
+    while (result == WSA_WAIT_IO_COMPLETION);
+    return result == WSA_WAIT_EVENT_0 ? index : ~0u;
+  };
+  for (DWORD i : {999u, 258u, 192u}) ASSERT_TRUE(WSASetEvent(e[i]));
+  for (DWORD i : {192u, 258u, 999u}) {
+    EXPECT_EQ(i, wait(e));
+    EXPECT_EQ(i, wait(e)) << "manual reset";
+    ASSERT_TRUE(WSAResetEvent(e[i]));
+  }
+  EXPECT_EQ(~0u, wait(e, 20));
+  EXPECT_EQ(WSA_WAIT_TIMEOUT, result);
+
+  ASSERT_TRUE(WSASetEvent(e[600]) && WSASetEvent(e[0]));
+  EXPECT_EQ(100u, wait(std::vector<WSAEVENT>(e.begin() + 500, e.end())));
+  EXPECT_EQ(399u, wait(std::vector<WSAEVENT>(e.rbegin(), e.rend())));
+  EXPECT_EQ(1u, wait({e[5], e[0], e[600], e[0]})) << "a repeated handle counts where it comes first";
+  EXPECT_EQ(0u, wait(e));
+  for (DWORD i : {0u, 600u}) WSAResetEvent(e[i]);
+
+  at900.send();
+  at750.send();
+  for (DatagramPair* p : {&at750, &at900}) {
+    EXPECT_EQ(p == &at750 ? 750u : 900u, wait(e, 5000));
+    WSANETWORKEVENTS ne{};
+    EXPECT_EQ(0, WSAEnumNetworkEvents(p->in, e[p == &at750 ? 750 : 900], &ne));
+    EXPECT_EQ(FD_READ, ne.lNetworkEvents);
+  }
+  EXPECT_EQ(~0u, wait(e, 50));
+  at750.read();
+  at750.send();
+  EXPECT_EQ(750u, wait(e, 5000)) << "a read re-enables FD_READ";
+  WSAResetEvent(e[750]);
+
+  std::thread setter([&] {
+    Sleep(50);
+    WSASetEvent(e[640]);
+  });
+  EXPECT_EQ(640u, wait(e, 5000));
+  setter.join();
+  ASSERT_TRUE(WSACloseEvent(e[3]));
+  for (int again = 0; again < 2; ++again) {
+    EXPECT_EQ(~0u, wait(e));
+    EXPECT_EQ(WSA_INVALID_HANDLE, WSAGetLastError());
+  }
+  e[3] = WSACreateEvent();
+  EXPECT_EQ(640u, wait(e));
+  pairs.clear();
+  for (WSAEVENT h : e) WSACloseEvent(h);
+}
+
+// What the system refuses inside a wait fails it with the matching Winsock
+// error, and the wait works again once the system agrees: no epoll
+// descriptor for a thread, a socket's registration refused, and a change of
+// what a socket waits for refused (applied again by the next wait).
+void refuseEpoll(bool refuse);  // epoll_faults.cpp
+int epollRefusals();
+
+TEST(Wait, RefusedEpollCallsFailTheWaitUntilTheSystemAgrees) {
+  Winsock ws;
+  WSAEVENT idle = WSACreateEvent(), event = WSACreateEvent();
+  DatagramPair pair(event);
+  std::thread([&] {  // a thread of its own: its wait set starts empty
+    DWORD index = 0;
+    const auto wait = [&](WSAEVENT h, DWORD ms) {
+      DWORD r;
+      while ((r = waitForAnyEvent(1, &h, ms, TRUE, &index)) == WSA_WAIT_IO_COMPLETION) {}
+      return r;
+    };
+    refuseEpoll(true);
+    EXPECT_EQ(WSA_WAIT_FAILED, wait(idle, 0));
+    EXPECT_EQ(WSAEMFILE, WSAGetLastError());
+    refuseEpoll(false);
+    EXPECT_EQ(WSA_WAIT_TIMEOUT, wait(idle, 0));
+    refuseEpoll(true);
+    EXPECT_EQ(WSA_WAIT_FAILED, wait(event, 0)) << "its socket can't be registered";
+    EXPECT_EQ(WSAENOBUFS, WSAGetLastError());
+    refuseEpoll(false);
+    pair.send();
+    EXPECT_EQ(WSA_WAIT_EVENT_0, wait(event, 5000));
+    WSANETWORKEVENTS ne{};
+    EXPECT_EQ(0, WSAEnumNetworkEvents(pair.in, event, &ne));
+    refuseEpoll(true);
+    pair.read();  // FD_READ wanted again, which the system refuses to note
+    pair.send();
+    EXPECT_EQ(WSA_WAIT_FAILED, wait(event, 100));
+    EXPECT_EQ(WSAENOBUFS, WSAGetLastError());
+    refuseEpoll(false);
+    EXPECT_EQ(WSA_WAIT_EVENT_0, wait(event, 5000));
+  }).join();
+  EXPECT_GE(epollRefusals(), 3);
+  WSACloseEvent(idle);
+  WSACloseEvent(event);
+}
+
 TEST(Mutex, OneNameIsOneRecursiveMutexOwnedByAThread) {
   HANDLE a = CreateMutexA(nullptr, FALSE, "system test mutex");
   HANDLE b = CreateMutexA(nullptr, FALSE, "system test mutex");
