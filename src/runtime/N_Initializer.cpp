@@ -47,6 +47,8 @@ void deleteRegistered(Q_DLList<T*>*& list) {
 // runtime runs).
 std::atomic<platform::DWORD> g_waitEventsSet{platform::WSA_MAXIMUM_WAIT_EVENTS};
 std::atomic<platform::DWORD> g_waitEventsInForce{0};
+// The wait set at Winsock's size, the default.
+platform::WSAEVENT g_defaultWaitSet[platform::WSA_MAXIMUM_WAIT_EVENTS];
 
 // Frees the buffers the records of a queue still own, then the queue.
 void deleteQueue(Q_DLList<N_Socket::DataQueue>*& queue) {
@@ -163,9 +165,11 @@ void N_Initializer::start() {
 
   m_eventRelease = platform::WSACreateEvent();
   // Once for the thread's life, never per pass: at the larger sizes the set
-  // is too big for the thread's stack.
+  // is too big for the thread's stack. Winsock's 64 take no allocation, so
+  // the default start counts exactly what it always did.
   m_uWaitEvents = g_waitEventsSet.load();
-  m_pWaitEvents = Q_NewArray<platform::WSAEVENT>(m_uWaitEvents);
+  m_pWaitEvents = m_uWaitEvents > platform::WSA_MAXIMUM_WAIT_EVENTS ? Q_NewArray<platform::WSAEVENT>(m_uWaitEvents)
+                                                                    : g_defaultWaitSet;
   g_waitEventsInForce.store(m_uWaitEvents);
 
   // The thread writes THREAD_RUNNING once, without looking; waiting for that
@@ -244,7 +248,7 @@ void N_Initializer::stop() {
   m_pPumpFrom = nullptr;
   m_uBytesWaitingForSend = 0;
 
-  Q_DeleteArray(m_pWaitEvents);
+  if (m_pWaitEvents != g_defaultWaitSet) Q_DeleteArray(m_pWaitEvents);
   m_pWaitEvents = nullptr;
   g_waitEventsInForce.store(0);
 
