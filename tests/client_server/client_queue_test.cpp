@@ -207,7 +207,7 @@ TEST_F(ClientQueueTest, AFailedAllocationLeavesTheQueueAsItWas) {
   for (const auto& [nth, step] : steps) {
     failAllocation(nth);
     EXPECT_THROW(step(), Q_MemoryException_Allocation*);
-    disarmFaults();
+    platform::fault::disarmAll();
     EXPECT_EQ(5u, waiting());
     EXPECT_EQ(0.0f, Access::nextFlushTime(client()));
   }

@@ -307,11 +307,11 @@ TEST_F(ClientScriptedTest, WithoutAServerOrAnAddress) {
       continue;
     }
     const bool fired = platform::fault::allocationsFailed() > 0;  // maybe on the network thread
-    disarmFaults();
+    platform::fault::disarmAll();
     if (!fired) break;
     empty.destruct();
   }
-  disarmFaults();
+  platform::fault::disarmAll();
   EXPECT_TRUE(empty.isConstructed());
   EXPECT_GE(failures, 4);  // two sockets and two queues at least
 }

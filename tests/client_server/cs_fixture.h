@@ -166,7 +166,7 @@ class PeerProcess {
   const std::string& host() const { return m_host; }
   // Reads lines until one contains `text`, pumping meanwhile.
   std::optional<std::string> waitLine(std::string_view text, int milliseconds, const Pump& pump = {});
-  bool command(std::string_view line) { return m_process.writeLine(line); }
+  bool command(const std::string& line) { return m_process.writeLine(line); }
   // Sends "quit" and waits for the process to end with 0.
   bool quit(int milliseconds, const Pump& pump = {});
   // Waits for "connected" and the server's hand-out.

@@ -187,7 +187,7 @@ TEST_F(ServerScriptedTest, DisconnectClientGivesTheShareBackInTheSameCall) {
   EXPECT_EQ(50000u, c.lastGrant(pump));
   failAllocation(1, true);
   EXPECT_NO_THROW(server.disconnectClient(cb));
-  disarmFaults();
+  platform::fault::disarmAll();
   EXPECT_EQ(1, ServerAccess::clientCount(server));
   EXPECT_EQ(60000u, c.lastGrant(pump));
 }
@@ -273,7 +273,7 @@ TEST_F(ServerScriptedTest, AFailedAcceptLeavesNoEntry) {
       } catch (Q_MemoryException_Allocation*) {
         threw = true;
       }
-      disarmFaults();
+      platform::fault::disarmAll();
       EXPECT_FALSE(contained && threw) << "a contained failure threw";
       const bool made = ServerAccess::clientCount(server) == 1;
       EXPECT_FALSE(threw && made);
@@ -373,7 +373,7 @@ TEST_F(ServerLimitsTest, ANewcomerTakesTheOldestWaitingPlace) {
   ServerPump pump{server};
   int fds[2];
   for (int i = 0; i < 2; ++i) {
-    fds[i] = raw::connectFrom(i == 0 ? "127.0.0.5" : "127.0.0.6", "127.0.0.1", static_cast<std::uint16_t>(port()));
+    fds[i] = raw::connectTo("127.0.0.1", static_cast<std::uint16_t>(port()), i == 0 ? "127.0.0.5" : "127.0.0.6");
     ASSERT_GE(fds[i], 0);
     ASSERT_TRUE(waitFor([&] { return ServerAccess::clientCount(server) == i + 1; }, 5000, pump));
   }

@@ -251,10 +251,10 @@ TEST_F(SocketTest, ListenersQueueTheirConnectionsInOrder) {
   const int portB = freePort(), newPort = freePort();
   CountingListener a(port()), b(portB);
   N_Socket::ConnectData* entry = nullptr;
-  const int toB1 = raw::connectFrom("127.0.0.2", "127.0.0.1", portB);
+  const int toB1 = raw::connectTo("127.0.0.1", portB, "127.0.0.2");
   ASSERT_TRUE(waitFor([&] { return b.calls == 1; }));
-  const int toA = raw::connectFrom("127.0.0.3", "127.0.0.1", port());
-  const int toB2 = raw::connectFrom("127.0.0.4", "127.0.0.1", portB);
+  const int toA = raw::connectTo("127.0.0.1", port(), "127.0.0.3");
+  const int toB2 = raw::connectTo("127.0.0.1", portB, "127.0.0.4");
   ASSERT_TRUE(waitFor([&] { return a.calls == 1 && b.calls == 2; }));
   EXPECT_EQ(1, a.queuedFirst.load());
   EXPECT_EQ(1, b.queuedFirst.load());  // b's second entry waits behind its first
@@ -267,7 +267,7 @@ TEST_F(SocketTest, ListenersQueueTheirConnectionsInOrder) {
     EXPECT_EQ(listener, entry->pListener);
     N_Socket& in = *accepted.emplace_back(std::make_unique<N_Socket>(entry));
     EXPECT_TRUE(in.isConnected() && in.getSocketType() == N_Socket::SOCKET_TCP);
-    EXPECT_EQ(raw_peer::localPort(fd), in.getPort());
+    EXPECT_EQ(raw::localPort(fd), in.getPort());
     EXPECT_STREQ(from, const_cast<const char*>(in.getAddress()->getStringNumber()));
     raw::closeFd(fd);
   }
@@ -473,7 +473,7 @@ TEST_F(StreamTest, AnEndOrBreakInsideAMessageEndsOnlyItsConnection) {
     int badFd = -1, goodFd = -1;
     ASSERT_TRUE(acceptRaw(listener, port(), bad, badFd));
     ASSERT_TRUE(acceptRaw(listener, port(), good, goodFd));
-    raw_peer::noDelay(badFd);
+    raw::noDelay(badFd);
     write(badFd, concat({framed(a), framed(a), c.pieces[0]}));
     for (std::size_t i = 1; i < c.pieces.size(); ++i) write(badFd, c.pieces[i]);
     if (c.collecting >= 0) {

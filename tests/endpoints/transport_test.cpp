@@ -69,7 +69,7 @@ TEST_F(TransportFaultsTest, PlatformCallsFailingLoseNothing) {
     ASSERT_NO_FATAL_FAILURE(exchange(out, in, c.countdown * 100));
     const int fired = platform::fault::fired(c.call);
     EXPECT_TRUE(c.persist ? fired > 5 : fired == 1) << fired;
-    disarmFaults();
+    platform::fault::disarmAll();
   }
 }
 
@@ -169,7 +169,7 @@ TEST_F(TransportFaultsTest, RunningOutOfMemoryAnywhere) {
     }
     fd = raw::acceptOne(listening, 5000);
     raw::closeFd(listening);
-    raw_peer::noDelay(fd);
+    raw::noDelay(fd);
     waitFor([&] { return in.isConnected(); });
     for (const Bytes& w : writes) {
       rawSend(fd, w);
@@ -255,7 +255,7 @@ TEST_F(TransportStressTest, TcpAndUdpExchangeWithAPeerProcess) {
   N_Address peerAddress("127.0.0.2");
   N_Socket udp(&peerAddress, port() + 1, N_Socket::SOCKET_UDP);
   ChildProcess peer(VARDEL_HOST_TRANSPORT_PEER, {"--port", std::to_string(port())});
-  ASSERT_TRUE(peer.started()) << peer.startError();
+  ASSERT_TRUE(peer.started());
   N_Socket::ConnectData* data = nullptr;
   ASSERT_TRUE(waitFor([&] { return listener.pollConnect(data); }, 20000));
   N_Socket tcp(data);

@@ -21,8 +21,7 @@
 #include "Q_System.h"
 #include "Q_Throw.h"
 #include "Q_Timer.h"
-#include "allocation_balance.h"
-#include "guards.h"
+#include "runtime_test.h"
 
 namespace {
 

@@ -23,7 +23,6 @@
 #include "N_Listener.h"
 #include "N_Socket.h"
 #include "Q_New.h"
-#include "allocation_balance.h"
 #include "guards.h"
 #include "fault_sweep.h"
 #include "raw_socket.h"
