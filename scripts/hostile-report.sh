@@ -4,7 +4,7 @@
 # what each attack cost the server: its peak RSS, its longest update() and
 # the good clients' p99 round trip while the attack ran.
 #
-#   scripts/hostile-report.sh [GTEST_FILTER]     e.g. 'HostileTest.Drip'
+#   scripts/hostile-report.sh [GTEST_FILTER]     e.g. '*/drip'
 #
 # Port 6000 must be free: don't run it beside other server tests.
 set -euo pipefail

@@ -8,7 +8,6 @@
 // Exit code 0; 2 for bad arguments; 3 if it couldn't pair.
 #include <arpa/inet.h>
 #include <netinet/tcp.h>
-#include <sys/resource.h>
 #include <sys/socket.h>
 
 #include <algorithm>
@@ -71,10 +70,10 @@ int openFrom(int index, int port = 0, int timeoutMs = 300, int receiveBuffer = 0
 
 // `count` connections from our addresses in turn (to `port` as openFrom),
 // held for `ms` (0: to the end) and closed; how many came up.
-long hold(int count, int first, int port, int ms, int timeoutMs = 300) {
+long hold(int count, int first, int port, int ms) {
   std::vector<int> fds;
   for (int i = first; i < first + count && !timeUp(); ++i)
-    if (int fd = openFrom(i, port, timeoutMs); fd >= 0) fds.push_back(fd);
+    if (int fd = openFrom(i, port); fd >= 0) fds.push_back(fd);
   std::this_thread::sleep_until(ms > 0 ? Clock::now() + std::chrono::milliseconds(ms) : g_end);
   for (int& fd : fds) closeFd(fd);
   return static_cast<long>(fds.size());
@@ -218,8 +217,6 @@ const std::map<std::string, std::function<long()>> kAttacks = {
      }},
     // Two hundred silent connections to both ports, held to the end.
     {"half-open", [] { return hold(200, 0, 0, 0); }},
-    // Forty-eight silent connections to P, four from each address.
-    {"descriptors", [] { return hold(4 * kSpread, 0, g_port, 0, 500); }},
     // 6000 messages of 8 bytes, each in a write of its own, on a data
     // connection that never pairs; held to the end.
     {"small-messages",
@@ -254,10 +251,6 @@ int main(int argc, char** argv) {
   const auto run = argc == 4 ? kAttacks.find(argv[2]) : kAttacks.end();
   if (run == kAttacks.end()) return std::fprintf(stderr, "usage: hostile_peer PORT ATTACK SECONDS\n"), 2;
   g_port = std::atoi(argv[1]);
-  // The test may have lowered the limit it handed down (descriptors); ours is
-  // our own business.
-  rlimit files{};
-  if (::getrlimit(RLIMIT_NOFILE, &files) == 0) files.rlim_cur = files.rlim_max, ::setrlimit(RLIMIT_NOFILE, &files);
   g_start = Clock::now();
   g_end = g_start + std::chrono::duration_cast<Clock::duration>(std::chrono::duration<double>(std::atof(argv[3])));
   say("attacking");
