@@ -130,12 +130,14 @@ TEST_F(SocketTest, ConnectAndDisconnectEvents) {
 }
 
 // receive() destroys its own socket, takes long while another thread
-// destroys it, or polls and declines, at the first of three messages of one
-// read: the rest is dropped, nothing touches a dead socket, destruct() waits
-// for the call, and a polled message is freed once (the balance tells).
+// destroys it, polls and declines, or throws, at the first of three messages
+// of one read. Nothing touches a dead socket and the rest is dropped;
+// destruct() waits for the call; a polled message is freed once (the balance
+// tells); an exception is dropped with a diagnostic line naming it, and its
+// message stays for poll() on a connection that goes on.
 class BusySocket : public N_Socket {
  public:
-  enum Mode { DESTRUCT, DELETE, SLOW, POLL } mode;
+  enum Mode { DESTRUCT, DELETE, SLOW, POLL, THROW } mode;
   explicit BusySocket(Mode m) : mode(m) {}
   ~BusySocket() { destruct(); }
   bool receive(void* data, unsigned size) override {
@@ -148,57 +150,42 @@ class BusySocket : public N_Socket {
     if (m == SLOW) platform::Sleep(200);
     while (m == POLL && poll(polled, polledSize)) own += polled == data && polledSize == size;
     ++finished;
+    if (m == THROW) throw 7;
     return m != POLL;
   }
-  static inline std::atomic<int> calls{0}, finished{0}, own{0};
+  static inline std::atomic<int> calls{0}, finished{0}, own{0}, traces{0};
 };
 
-TEST_F(SocketTest, ReceiveMayDestroyItsSocketOrPoll) {
+TEST_F(SocketTest, ReceiveMayDestroyItsSocketPollOrThrow) {
   using enum BusySocket::Mode;
+  Sys->setVerboseSink([](const char* line) { BusySocket::traces += std::strstr(line, "receive: ") != nullptr; });
   N_Listener listener(port());
-  for (BusySocket::Mode mode : {DESTRUCT, DELETE, SLOW, POLL}) {
+  for (BusySocket::Mode mode : {DESTRUCT, DELETE, SLOW, POLL, THROW}) {
     SCOPED_TRACE(mode);
-    BusySocket::calls = BusySocket::finished = BusySocket::own = 0;
+    BusySocket::calls = BusySocket::finished = BusySocket::own = BusySocket::traces = 0;
     auto* in = new BusySocket(mode);
     int fd = -1;
     ASSERT_TRUE(acceptRaw(listener, port(), *in, fd));
     ASSERT_TRUE(rawSend(fd, concat({framed(pattern(5, 1)), framed(pattern(6, 2)), framed(pattern(7, 3))})));
-    ASSERT_TRUE(waitFor([&] { return BusySocket::calls == (mode == POLL ? 3 : 1); }));
+    const int all = mode == POLL || mode == THROW ? 3 : 1;
+    ASSERT_TRUE(waitFor([&] { return BusySocket::calls == all; }));
     if (mode == SLOW) in->destruct();  // waits for the calls under way
     const int calls = BusySocket::calls;
     EXPECT_TRUE(mode != SLOW || BusySocket::finished == calls);
     pumpFor(50, {});
-    EXPECT_EQ(mode == SLOW ? calls : mode == POLL ? 3 : 1, BusySocket::calls.load());
+    EXPECT_EQ(mode == SLOW ? calls : all, BusySocket::calls.load());
     EXPECT_EQ(calls, BusySocket::finished.load());
     EXPECT_EQ(mode == POLL ? 3 : 0, BusySocket::own.load());
-    EXPECT_EQ(mode == POLL ? 1 : 0, registeredSockets());
+    EXPECT_EQ(mode == POLL || mode == THROW ? 1 : 0, registeredSockets());
+    EXPECT_EQ(mode == THROW ? 3 : 0, BusySocket::traces.load());
+    if (mode == THROW) {
+      for (unsigned i = 1; i <= 3; ++i) EXPECT_TRUE(nextMessage(*in, pattern(4 + i, i)));
+      EXPECT_TRUE(in->isConnected());
+    }
     if (mode != DELETE) delete in;
     raw::closeFd(fd);
   }
-}
-
-// An exception out of receive() is dropped with a diagnostic line naming
-// it; the message stays for poll() and the connection goes on.
-TEST_F(SocketTest, AThrowingReceiveLeavesATraceAndItsMessage) {
-  static std::atomic<int> traces{0};
-  Sys->setVerboseSink([](const char* line) { traces += std::strstr(line, "receive: ") != nullptr; });
-  struct Throwing : N_Socket {
-    ~Throwing() { destruct(); }
-    bool receive(void*, unsigned) override { throw 7; }
-  } in;
-  N_Listener listener(port());
-  int fd = -1;
-  ASSERT_TRUE(acceptRaw(listener, port(), in, fd));
-  ASSERT_TRUE(rawSend(fd, concat({framed(pattern(5, 1)), framed(pattern(6, 2))})));
-  Bytes got;
-  for (std::size_t size : {5u, 6u}) {
-    ASSERT_TRUE(pollMessage(in, got, 5000));
-    EXPECT_EQ(size, got.size());
-  }
-  EXPECT_EQ(2, traces.load());
-  EXPECT_TRUE(in.isConnected());
   Sys->setVerboseSink(nullptr);
-  raw::closeFd(fd);
 }
 
 // Sends still queued and reads still under way when their socket goes: the
