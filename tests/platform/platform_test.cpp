@@ -1,7 +1,5 @@
-// The Winsock-shaped platform layer on Linux: network events follow Winsock's
-// recording rules; overlapped sends and reads complete once each, in order,
-// on the issuing thread and only inside its alertable waits; waits, mutexes,
-// threads, rand, names, and the fault plans of every call.
+// The Winsock-shaped platform layer on Linux: network events, overlapped
+// sends and reads, waits, mutexes, rand, names, and every call's fault plan.
 #include <gtest/gtest.h>
 
 #include <atomic>
@@ -45,10 +43,8 @@ SOCKET makeListener(std::uint16_t& port) {
 }
 
 struct Winsock {
-  Winsock() {
-    WSADATA data;
-    EXPECT_EQ(0, WSAStartup(0x0002, &data));
-  }
+  WSADATA data;
+  Winsock() { EXPECT_EQ(0, WSAStartup(0x0002, &data)); }
   ~Winsock() { WSACleanup(); }
 };
 
@@ -70,9 +66,9 @@ struct EventLog {
       if (ne.lNetworkEvents & (1L << bit)) errors[bit] = ne.iErrorCode[bit], ++counts[bit];
     return ne.lNetworkEvents;
   }
-  // Waits alertably until every one of `bits` has been seen since `seen` was cleared.
-  bool await(long bits) {
-    return waitFor([&] { return (take(), seen & bits) == bits; }, 5000, [&] { WSAWaitForMultipleEvents(1, &event, FALSE, 50, TRUE); });
+  bool await(long bits) {  // alertably, until all of `bits` were seen since `seen` was cleared
+    return waitFor([&] { return (take(), seen & bits) == bits; }, 5000,
+                   [&] { WSAWaitForMultipleEvents(1, &event, FALSE, 50, TRUE); });
   }
   bool quiet() { return WSAWaitForMultipleEvents(1, &event, FALSE, 100, TRUE) == WSA_WAIT_TIMEOUT; }
 };
