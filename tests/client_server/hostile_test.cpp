@@ -65,6 +65,7 @@ struct Attack {
   bool paired = false;  // pairs like a client first
   bool cutOff = false;  // the server must drop it
 };
+void PrintTo(const Attack& a, std::ostream* os) { *os << a.name; }
 
 class HostileTest : public ClientServerTest, public ::testing::WithParamInterface<Attack> {
  protected:
