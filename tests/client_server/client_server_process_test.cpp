@@ -20,25 +20,18 @@ constexpr int kPayloads = 60;  // twenty instrumented processes share the cores
 constexpr int kPayloads = 300;
 #endif
 
-// The payloads "<prefix><i>;" in a batch.
-std::vector<std::string> split(const std::string& batch) {
-  std::vector<std::string> out;
-  std::size_t start = 0;
-  for (std::size_t end; (end = batch.find(';', start)) != std::string::npos; start = end + 1)
-    out.push_back(batch.substr(start, end - start));
-  return out;
-}
-
-// Every payload the server's end of a client can read now. With simulated
-// loss a false read doesn't mean that nothing is left, so it reads a fixed
-// number of times (a read that finds nothing draws nothing).
+// The payloads "<prefix><i>;" the server's end of a client can read now.
+// With simulated loss a false read doesn't mean that nothing is left, so it
+// reads a fixed number of times (a read that finds nothing draws nothing).
 std::vector<std::string> readPayloads(N_Client& client, int reads = 500) {
   std::vector<std::string> out;
   void* m = nullptr;
   unsigned n = 0;
-  for (int i = 0; i < reads; ++i)
-    if (client.poll(m, n))
-      for (std::string& p : split(std::string(static_cast<const char*>(m), n))) out.push_back(std::move(p));
+  for (int i = 0; i < reads; ++i) {
+    const std::string batch = client.poll(m, n) ? std::string(static_cast<const char*>(m), n) : "";
+    for (std::size_t at = 0, end; (end = batch.find(';', at)) != std::string::npos; at = end + 1)
+      out.push_back(batch.substr(at, end - at));
+  }
   return out;
 }
 
