@@ -372,7 +372,15 @@ TEST_F(ServerLimitsTest, ANewcomerTakesTheOldestWaitingPlace) {
   EXPECT_TRUE(raw::closedByPeer(fds[0], 5000));
   EXPECT_FALSE(raw::closedByPeer(fds[1], 200));
   EXPECT_EQ(2, ServerAccess::clientCount(server));
+  // Lone control connections are bounded per address too: the third is closed on arrival.
+  LimitsGuard perAddress(limits(600.0f, 32, 2));
+  int control[3];
+  for (int& fd : control) fd = raw::connectTo("127.0.0.1", CM::CONTROL_PORT, "127.0.0.7");
+  EXPECT_TRUE(waitFor([&] { return raw::closedByPeer(control[2], 0); }, 5000, pump));
+  EXPECT_TRUE(staysFalse([&] { return raw::closedByPeer(control[0], 0) || raw::closedByPeer(control[1], 0); }, 300, pump));
+  EXPECT_EQ(2, ServerAccess::pendingControlCount(server));
   for (int fd : fds) raw::closeFd(fd);
+  for (int fd : control) raw::closeFd(fd);
 }
 
 // A budget of control messages per client and update, and the requests of

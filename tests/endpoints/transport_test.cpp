@@ -19,17 +19,14 @@
 static std::atomic<long long> g_arrayBytes{0};
 void* operator new[](std::size_t size, const std::nothrow_t&) noexcept {
   void* p = std::malloc(size == 0 ? 1 : size);
-  if (p != nullptr) g_arrayBytes += static_cast<long long>(malloc_usable_size(p));
+  g_arrayBytes += static_cast<long long>(malloc_usable_size(p));
   return p;
 }
 void* operator new[](std::size_t size) {
   void* p = operator new[](size, std::nothrow);
   return p != nullptr ? p : throw std::bad_alloc();
 }
-void operator delete[](void* p) noexcept {
-  if (p != nullptr) g_arrayBytes -= static_cast<long long>(malloc_usable_size(p));
-  std::free(p);
-}
+void operator delete[](void* p) noexcept { g_arrayBytes -= static_cast<long long>(malloc_usable_size(p)), std::free(p); }
 void operator delete[](void* p, std::size_t) noexcept { operator delete[](p); }
 void operator delete[](void* p, const std::nothrow_t&) noexcept { operator delete[](p); }
 
@@ -207,9 +204,7 @@ TEST_F(TransportFaultsTest, CompactMessagesHoldWhatArrived) {
     before = g_arrayBytes.load();
     for (unsigned i = 0; i < 200; ++i) inject(in, framed(pattern(8, i)));
     if (compact) EXPECT_LT(g_arrayBytes.load() - before, 200 * 1024); else EXPECT_GE(g_arrayBytes.load() - before, 200LL * 65536);
-    for (unsigned i = 0; i < 200; ++i) {
-      ASSERT_TRUE(nextMessage(in, pattern(8, i), 0));
-    }
+    for (unsigned i = 0; i < 200; ++i) ASSERT_TRUE(nextMessage(in, pattern(8, i), 0));
   }
 }
 
