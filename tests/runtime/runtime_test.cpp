@@ -3,7 +3,6 @@
 // two locks) and address resolution over this machine's real name service.
 // Expectations come from the platform's own lookups, not from how the hosts
 // file names 127.0.0.1.
-#include <dirent.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -11,19 +10,16 @@
 #include <cstdio>
 #include <cstring>
 #include <ctime>
-#include <functional>
+#include <filesystem>
 #include <ostream>
 #include <string>
 #include <thread>
 #include <vector>
 
-#include "N_Address.h"
 #include "N_Exceptions.h"
-#include "N_Initializer.h"
 #include "N_Listener.h"
 #include "N_Socket.h"
 #include "Q_New.h"
-#include "guards.h"
 #include "fault_sweep.h"
 #include "raw_socket.h"
 #include "runtime_test.h"
@@ -36,15 +32,9 @@ using platform::DWORD;
 using platform::WSAPROTOCOL_INFOA;
 using platform::fault::Call;
 
-// The threads of this process, as /proc/self/task lists them (the runtime's
-// threads have no names).
+// The threads of this process (the runtime's threads have no names).
 int threadCount() {
-  int count = 0;
-  if (DIR* dir = ::opendir("/proc/self/task")) {
-    while (dirent* entry = ::readdir(dir)) count += entry->d_name[0] != '.';
-    ::closedir(dir);
-  }
-  return count;
+  return static_cast<int>(std::distance(std::filesystem::directory_iterator("/proc/self/task"), {}));
 }
 // Sanitizers start a helper thread with the process's first thread; starting
 // one at load makes that happen before any test counts.
@@ -74,8 +64,7 @@ constexpr const char* kNotResolved = "IP address is not resolved yet";
 
 WSAPROTOCOL_INFOA entry(int family, DWORD flags) {
   WSAPROTOCOL_INFOA info{};
-  info.iAddressFamily = family;
-  info.dwServiceFlags1 = flags;
+  info.iAddressFamily = family, info.dwServiceFlags1 = flags;
   return info;
 }
 Arm startup(int code) { return [=](FaultGuard& f) { f.arm(Call::WSAStartup, {1, false, code}); }; }
