@@ -16,10 +16,10 @@ std::string hostOf(const N_Client* client) {
   return number != nullptr ? const_cast<const char*>(number) : "";
 }
 
-static Received parse(const void* message, unsigned size, Clock::time_point start) {
+static Received parse(const void* message, unsigned size) {
   const auto* b = static_cast<const unsigned char*>(message);
   auto word = [&](int at) { return b[at] | b[at + 1] << 8 | b[at + 2] << 16 | std::uint32_t{b[at + 3]} << 24; };
-  return {size, size >= 4 ? word(0) : 0, size >= 8 ? word(4) : 0, secondsSince(start)};
+  return {size, size >= 4 ? word(0) : 0, size >= 8 ? word(4) : 0};
 }
 
 void ClientServerTest::SetUp() {
@@ -45,7 +45,7 @@ ScriptedServer::ScriptedServer(int port) : m_dataListener(port), m_controlListen
       void* message = nullptr;
       unsigned size = 0;
       while (m_control && m_control->poll(message, size)) {
-        const Received& r = m_received.emplace_back(parse(message, size, m_start));
+        const Received& r = m_received.emplace_back(parse(message, size));
         Bytes reply;
         if (r.type == CM::CONTROL_HEARTBEAT && answerHeartbeats) reply = controlBytes(CM::CONTROL_HEARTBEAT_REPLY);
         if (r.type == CM::CONTROL_WORLD_TIME_REQUEST && worldTimeAnswers != 0) {
@@ -98,7 +98,7 @@ std::optional<Received> ScriptedClient::next(int milliseconds, const Pump& pump)
   void* message = nullptr;
   unsigned size = 0;
   if (!waitFor([&] { return m_control->poll(message, size); }, milliseconds, pump)) return std::nullopt;
-  return parse(message, size, m_start);
+  return parse(message, size);
 }
 
 std::vector<Received> ScriptedClient::drain(int milliseconds, const Pump& pump) {

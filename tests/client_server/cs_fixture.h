@@ -74,7 +74,6 @@ class ClientServerTest : public RuntimeTest {
 struct Received {
   unsigned size;
   std::uint32_t type, value;
-  double at;  // seconds since the scripted end started
 };
 
 // The server end played by plain sockets on a thread of its own: it accepts
@@ -101,7 +100,6 @@ class ScriptedServer {
   std::mutex m_lock;
   std::unique_ptr<N_Socket> m_data, m_control;
   std::vector<Received> m_received;
-  Clock::time_point m_start = Clock::now();
   std::atomic<bool> m_bStop{false};
   std::thread m_thread;
 };
@@ -128,7 +126,6 @@ class ScriptedClient {
   const N_Address* m_pServer;
   int m_iPort;
   std::optional<N_Socket> m_data, m_control;
-  Clock::time_point m_start = Clock::now();
 };
 
 // update() then pollConnect() until false, keeping the clients handed out.

@@ -91,7 +91,7 @@ TEST(QMemory, AllocationsReleasesAndFaultsAreCountedOnce) {
   EXPECT_EQ(3, balance.outstanding());
 }
 
-TEST(QDLList, KeepsOrderAndAddressesThroughRemovalsAndFailuresAndFreesEverything) {
+TEST(QDLList, KeepsOrderAddressesAndIndicesThroughChangesAndFailuresAndFreesEverything) {
   AllocationBalance balance;
   {
     IntList list;
@@ -118,10 +118,7 @@ TEST(QDLList, KeepsOrderAndAddressesThroughRemovalsAndFailuresAndFreesEverything
     list.m_pSpareB = Q_Memory::allocate(8);
   }
   EXPECT_EQ(1, balance.outstanding()) << "the destructor frees the nodes left and both spare blocks";
-}
-
-// getAt in any order, and after the list changed under an index.
-TEST(QDLList, GetAtFindsEachIndexInAnyOrderAndAfterChanges) {
+  // getAt in any order, and after the list changed under an index.
   IntList list;
   for (int i = 0; i < 10; ++i) *list.append() = i;
   for (int i : {0, 1, 2, 3, 4, 5, 6, 7, 8, 9, 9, 8, 7, 6, 5, 4, 3, 2, 1, 0, 5, 0, 9, 3, 3, 8, 1, 6}) EXPECT_EQ(i, *list.getAt(i));
