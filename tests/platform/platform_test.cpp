@@ -184,6 +184,8 @@ TEST(EventSelect, EachEventIsRecordedOnceUntilReEnabled) {
   EXPECT_EQ(WSAECONNREFUSED, refused.errors[FD_CONNECT_BIT]);
   EXPECT_TRUE(refused.quiet());
   EXPECT_EQ(FD_CONNECT, refused.seen | refused.take());
+  EXPECT_EQ(SOCKET_ERROR, WSAEnumNetworkEvents(refused.socket, refused.event, nullptr));
+  EXPECT_EQ(WSAEFAULT, WSAGetLastError()) << "nowhere to write the events";
   Record never;
   EXPECT_EQ(SOCKET_ERROR, post(true, refused.socket, "x", 1, never));
   EXPECT_EQ(WSAENOTCONN, WSAGetLastError());
@@ -271,6 +273,9 @@ TEST(Overlapped, ManySendsArriveIntactAndCompleteInOrder) {
   closesocket(c.server->socket);
   ASSERT_TRUE(settles(cut[3]));
   EXPECT_TRUE(cut[3].error != 0 && cut[3].bytes < payload.size()) << cut[3].error;
+  Record late;
+  EXPECT_TRUE(post(true, c.client.socket, "x", 1, late) == SOCKET_ERROR && WSAGetLastError() != WSA_IO_PENDING)
+      << "a broken stream refuses further sends at once";
 }
 
 TEST(Wait, GivesTheLowestSignalledIndexAndEventsStaySetUntilReset) {
