@@ -4,8 +4,7 @@
 // every millisecond. It prints "connected" / "lost" as isConnected() changes,
 // "bandwidth N" and "latency X" as they change, "recv N TEXT" for each
 // message, "flushed", "error TEXT", and "bye" at "quit". Commands:
-//   sync                      prints "sync OK SECONDS" of updateWorldTimer()
-//   time | limits             prints "time AGE" of the world timer / "limits LARGEST" unreliable size
+//   limits                    prints "limits LARGEST", the largest unreliable size
 //   stall SECONDS | bandwidth N | fr | fu (flush reliable / unreliable once)
 //   qrn KEY PRIO SIZE CHAR | qun ...   queue SIZE copies of CHAR, reliable / unreliable
 //   send-r COUNT PREFIX [MS [stamp]] | send-u ...
@@ -24,7 +23,6 @@
 #include "N_Client.h"
 #include "N_Initializer.h"
 #include "Q_Exception.h"
-#include "Q_Timer.h"
 #include "peer_input.h"
 #include "vardel_platform.h"
 #include "win32.h"
@@ -36,12 +34,6 @@ using Clock = std::chrono::steady_clock;
 void queue(N_Client& client, bool reliable, std::string text, unsigned key = 0, unsigned priority = 1) {
   (client.*(reliable ? &N_Client::queueReliable : &N_Client::queueUnreliable))(text.data(), unsigned(text.size()), key,
                                                                             priority);
-}
-
-std::string number(const char* format, double value) {
-  char text[64];
-  std::snprintf(text, sizeof text, format, value);
-  return text;
 }
 
 struct Sender {
@@ -62,13 +54,7 @@ struct Sender {
 };
 
 void run(N_Client& client, std::istringstream& in, const std::string& command, Sender* senders) {
-  if (command == "sync") {
-    Q_Timer took;
-    const bool ok = client.updateWorldTimer();
-    say(std::string("sync ") + (ok ? "1" : "0") + number(" %.6f", took.getAge()));
-  } else if (command == "time") {
-    say(number("time %.6f", client.getWorldTimer().getAge()));
-  } else if (command == "limits") {
+  if (command == "limits") {
     say("limits " + std::to_string(client.getLargestUnreliablePacketSize()));
   } else if (command == "stall") {
     double seconds = 0;
@@ -148,7 +134,7 @@ int main(int argc, char** argv) {
       }
       if (connected && client->getBandwidth() != lastBandwidth)
         say("bandwidth " + std::to_string(lastBandwidth = client->getBandwidth()));
-      if (client->getLatency() != lastLatency) say(number("latency %.6f", lastLatency = client->getLatency()));
+      if (client->getLatency() != lastLatency) say("latency " + std::to_string(lastLatency = client->getLatency()));
     }
     return 0;
   } catch (Q_Exception* e) {
