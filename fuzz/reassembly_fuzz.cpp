@@ -92,7 +92,8 @@ Expected reference(const unsigned char* stream, std::size_t size, std::uint32_t 
   Expected e;
   std::size_t at = 0;
   while (size - at >= 4) {
-    const std::uint32_t length = stream[at] | stream[at + 1] << 8 | stream[at + 2] << 16 | std::uint32_t{stream[at + 3]} << 24;
+    const std::uint32_t length =
+        stream[at] | stream[at + 1] << 8 | stream[at + 2] << 16 | std::uint32_t{stream[at + 3]} << 24;
     if (length > maximumLength) {
       e.broken = true;
       return e;
@@ -180,6 +181,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     if (unsigned int noneSize; socket.poll(none, noneSize)) std::abort();
   }
   const int refused = g_refusedBlocks.load() - refusedBefore;
-  if (Q_Memory::sm_iNewCount.load() - newBefore - refused != Q_Memory::sm_iDeleteCount.load() - deleteBefore) std::abort();
+  if (Q_Memory::sm_iNewCount.load() - newBefore - refused != Q_Memory::sm_iDeleteCount.load() - deleteBefore)
+    std::abort();
   return 0;
 }

@@ -80,7 +80,8 @@ TEST_F(ClientScriptedTest, ReceivedControlMessagesActByTypeAndSkipTheRest) {
   EXPECT_EQ(N_Client::HEARTBEAT_SEND, Access::state(client));  // the machine is off
 
   // Too short for their type: dropped, not read past their end.
-  for (const Bytes& b : {controlBytes(CM::CONTROL_BANDWIDTH_GRANT, 55, 4), controlBytes(CM::CONTROL_WORLD_TIME, CM::floatBits(9.0f), 6),
+  for (const Bytes& b : {controlBytes(CM::CONTROL_BANDWIDTH_GRANT, 55, 4),
+                         controlBytes(CM::CONTROL_WORLD_TIME, CM::floatBits(9.0f), 6),
                          controlBytes(CM::CONTROL_HEARTBEAT, 0, 2), controlBytes(CM::CONTROL_HEARTBEAT)})
     script.sendControl(b);
   ASSERT_TRUE(script.waitControl(opening + 1, 2000, updating(client)));

@@ -114,7 +114,9 @@ class ScriptedClient {
   bool connected() { return m_data && m_data->isConnected() && m_control && m_control->isConnected(); }
   bool closed() { return !m_data->isConnected() && !m_control->isConnected(); }
   void send(std::uint32_t type, std::uint32_t value = 0) { sendRaw(controlBytes(type, value)); }
-  void sendRaw(const Bytes& bytes) { m_control->send(const_cast<unsigned char*>(bytes.data()), unsigned(bytes.size())); }
+  void sendRaw(const Bytes& bytes) {
+    m_control->send(const_cast<unsigned char*>(bytes.data()), unsigned(bytes.size()));
+  }
   std::optional<Received> next(int milliseconds, const Pump& pump);
   std::vector<Received> drain(int milliseconds, const Pump& pump);  // all that arrives within the time
   // The value of the last grant among what arrives within the time.
@@ -157,7 +159,7 @@ class PeerProcess {
   std::optional<std::string> waitLine(const std::string& text, int milliseconds, const Pump& pump = {});
   bool command(const std::string& line) { return m_process.writeLine(line); }
   bool quit(int milliseconds, const Pump& pump = {});  // "quit", and the process ends with 0
-  N_Client* admit(const ServerPump& pump);               // "connected" and the server's hand-out
+  N_Client* admit(const ServerPump& pump);             // "connected" and the server's hand-out
   ChildProcess& process() { return m_process; }
 
  private:

@@ -27,7 +27,7 @@ TEST_F(ServerScriptedTest, ControlMessagesAreAnsweredInOrderAndTheRestDropped) {
 
   // Not the server's, or too short: nothing comes back for these.
   for (const Bytes& b : {controlBytes(0, 1), controlBytes(9, 2, 8), controlBytes(CM::CONTROL_BANDWIDTH_GRANT, 99),
-                         controlBytes(CM::CONTROL_ECHO_REPLY), controlBytes(CM::CONTROL_WORLD_TIME, CM::floatBits(3.0f)),
+                         controlBytes(CM::CONTROL_ECHO_REPLY), controlBytes(CM::CONTROL_WORLD_TIME, CM::floatBits(3)),
                          controlBytes(CM::CONTROL_BANDWIDTH_REQUEST, 77, 4),
                          controlBytes(CM::CONTROL_BANDWIDTH_REQUEST, 78, 7), controlBytes(CM::CONTROL_ECHO, 0, 3)})
     a.sendRaw(b);
@@ -378,7 +378,8 @@ TEST_F(ServerLimitsTest, ANewcomerTakesTheOldestWaitingPlace) {
   int control[3];
   for (int& fd : control) fd = raw::connectTo("127.0.0.1", CM::CONTROL_PORT, "127.0.0.7");
   EXPECT_TRUE(waitFor([&] { return raw::closedByPeer(control[2], 0); }, 5000, pump));
-  EXPECT_TRUE(staysFalse([&] { return raw::closedByPeer(control[0], 0) || raw::closedByPeer(control[1], 0); }, 300, pump));
+  EXPECT_TRUE(
+      staysFalse([&] { return raw::closedByPeer(control[0], 0) || raw::closedByPeer(control[1], 0); }, 300, pump));
   EXPECT_EQ(2, ServerAccess::pendingControlCount(server));
   for (int fd : fds) raw::closeFd(fd);
   for (int fd : control) raw::closeFd(fd);

@@ -102,7 +102,8 @@ TEST_F(SyscallTest, StreamsComeThroughShortWritesInterruptionsAndRefusals) {
     send(u, m);
     ASSERT_TRUE(raw::receiveExactly(peer, got.data(), m.size(), 5000)) << i;
     EXPECT_EQ(m, got);
-    ASSERT_EQ(long(m.size()), ::sendto(peer, m.data(), m.size(), 0, reinterpret_cast<const sockaddr*>(&back), sizeof back));
+    ASSERT_EQ(long(m.size()),
+              ::sendto(peer, m.data(), m.size(), 0, reinterpret_cast<const sockaddr*>(&back), sizeof back));
     ASSERT_TRUE(nextMessage(u, m)) << i;
   }
   raw::closeFd(peer);

@@ -26,7 +26,10 @@ void* operator new[](std::size_t size) {
   void* p = operator new[](size, std::nothrow);
   return p != nullptr ? p : throw std::bad_alloc();
 }
-void operator delete[](void* p) noexcept { g_arrayBytes -= static_cast<long long>(malloc_usable_size(p)), std::free(p); }
+void operator delete[](void* p) noexcept {
+  g_arrayBytes -= static_cast<long long>(malloc_usable_size(p));
+  std::free(p);
+}
 void operator delete[](void* p, std::size_t) noexcept { operator delete[](p); }
 void operator delete[](void* p, const std::nothrow_t&) noexcept { operator delete[](p); }
 

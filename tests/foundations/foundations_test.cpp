@@ -121,7 +121,8 @@ TEST(QDLList, KeepsOrderAddressesAndIndicesThroughChangesAndFailuresAndFreesEver
   // getAt in any order, and after the list changed under an index.
   IntList list;
   for (int i = 0; i < 10; ++i) *list.append() = i;
-  for (int i : {0, 1, 2, 3, 4, 5, 6, 7, 8, 9, 9, 8, 7, 6, 5, 4, 3, 2, 1, 0, 5, 0, 9, 3, 3, 8, 1, 6}) EXPECT_EQ(i, *list.getAt(i));
+  for (int i : {0, 1, 2, 3, 4, 5, 6, 7, 8, 9, 9, 8, 7, 6, 5, 4, 3, 2, 1, 0, 5, 0, 9, 3, 3, 8, 1, 6})
+    EXPECT_EQ(i, *list.getAt(i));
   for (int outside : {-1, 10, IntList::kInvalidCacheIndex}) EXPECT_EQ(nullptr, list.getAt(outside));
   *list.append() = 10;
   EXPECT_EQ(10, *list.getAt(10));

@@ -7,6 +7,7 @@
 // (setMaximumBandwidthUsage) | burst COUNT PREFIX (COUNT reliable messages
 // "PREFIX<i>;" to every client, each flushed on its own while the network
 // thread is held, so that they all leave in one write).
+#include <algorithm>
 #include <chrono>
 #include <cstdlib>
 #include <sstream>
@@ -42,13 +43,15 @@ int main(int argc, char** argv) {
     say("ready");
     for (; !input.finished(); std::this_thread::sleep_for(std::chrono::milliseconds(1))) {
       server.update();
-      for (N_Client* joined; server.pollConnect(joined);)
-        clients.push_back(joined), say(std::string("client ") + const_cast<const char*>(joined->getAddress()->getStringNumber()));
+      for (N_Client* joined; server.pollConnect(joined);) {
+        clients.push_back(joined);
+        say(std::string("client ") + const_cast<const char*>(joined->getAddress()->getStringNumber()));
+      }
       void* message;
       unsigned size;
       for (N_Client* client : clients)
         while (client->poll(message, size))
-          say("recv " + std::to_string(size) + " " + std::string(static_cast<const char*>(message), size < 24 ? size : 24));
+          say("recv " + std::to_string(size) + " " + std::string(static_cast<char*>(message), std::min(size, 24u)));
       for (std::string line; input.next(line);) {
         std::istringstream in(line);
         std::string command, prefix;

@@ -31,9 +31,12 @@ static int run(int port) {
     unsigned size = 0;
     N_Socket* from = tcp.poll(data, size) ? &tcp : udp.poll(data, size) ? &udp : nullptr;
     if (from == &tcp && size == 4 && std::memcmp(data, "quit", 4) == 0) break;
-    if (from != nullptr) from->send(data, size), lastHeard = Clock::now();
-    else if (!tcp.isConnected() || Clock::now() - lastHeard > std::chrono::seconds(30)) return 2;
-    else platform::Sleep(1);
+    if (from != nullptr)
+      from->send(data, size), lastHeard = Clock::now();
+    else if (!tcp.isConnected() || Clock::now() - lastHeard > std::chrono::seconds(30))
+      return 2;
+    else
+      platform::Sleep(1);
   }
   // Everything sent leaves before the connection ends.
   for (auto start = Clock::now(); tcp.getBytesWaitingForSend() > 0 && Clock::now() - start < std::chrono::seconds(20);)

@@ -76,8 +76,10 @@ std::optional<int> ChildProcess::wait(int timeoutMs) {
   while (!m_exitStatus && started()) {
     if (::waitpid(m_pid, &status, WNOHANG) == m_pid)
       m_exitStatus = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-    else if (Clock::now() >= deadline) break;
-    else std::this_thread::sleep_for(std::chrono::milliseconds(2));
+    else if (Clock::now() >= deadline)
+      break;
+    else
+      std::this_thread::sleep_for(std::chrono::milliseconds(2));
   }
   return m_exitStatus;
 }

@@ -42,7 +42,8 @@ namespace {
 }  // namespace
 
 ::testing::AssertionResult sweepAllocations(const std::function<void()>& scenario, int maxRuns) {
-  return sweep([](int n) { failAllocation(n); }, [] { return platform::fault::allocationsFailed(); }, scenario, maxRuns);
+  return sweep([](int n) { failAllocation(n); }, [] { return platform::fault::allocationsFailed(); }, scenario,
+               maxRuns);
 }
 
 ::testing::AssertionResult sweepCall(platform::fault::Call call, int result, const std::function<void()>& scenario,

@@ -49,7 +49,9 @@ struct FaultGuard {
 
 // The process-wide limits for one scope; the earlier ones come back after.
 struct LimitsGuard {
-  explicit LimitsGuard(const N_Limits& limits) : before(N_Initializer::getLimits()) { N_Initializer::setLimits(limits); }
+  explicit LimitsGuard(const N_Limits& limits) : before(N_Initializer::getLimits()) {
+    N_Initializer::setLimits(limits);
+  }
   ~LimitsGuard() { N_Initializer::setLimits(before); }
   LimitsGuard(const LimitsGuard&) = delete;
   LimitsGuard& operator=(const LimitsGuard&) = delete;
@@ -64,7 +66,8 @@ struct Watchdog {
       : thread([=](std::stop_token stop) {
           std::mutex m;
           std::unique_lock<std::mutex> hold(m);
-          std::condition_variable_any().wait_for(hold, stop, std::chrono::duration<double>(seconds), [] { return false; });
+          std::condition_variable_any().wait_for(hold, stop, std::chrono::duration<double>(seconds),
+                                                 [] { return false; });
           if (stop.stop_requested()) return;
           std::fprintf(stderr, "\nWATCHDOG: \"%s\" still running after %.1f s; giving up\n", what, seconds);
           ::_exit(3);

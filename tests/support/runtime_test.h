@@ -31,7 +31,9 @@ bool waitFor(const std::function<bool()>& done, int milliseconds = 5000, const P
 inline bool staysFalse(const std::function<bool()>& condition, int milliseconds, const Pump& pump = {}) {
   return !waitFor(condition, milliseconds, pump);
 }
-inline void pumpFor(int milliseconds, const Pump& pump) { waitFor([] { return false; }, milliseconds, pump); }
+inline void pumpFor(int milliseconds, const Pump& pump) {
+  waitFor([] { return false; }, milliseconds, pump);
+}
 inline double secondsSince(Clock::time_point start) {
   return std::chrono::duration<double>(Clock::now() - start).count();
 }
