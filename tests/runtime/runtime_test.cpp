@@ -218,33 +218,23 @@ TEST_F(RuntimeLife, LockOrderHoldsOnAllPathsAtOnce) {
     }
     platform::CloseHandle(mutex);
   });
-  // Sockets read their peer's identifier with the runtime's mutex held.
-  threads.emplace_back([&] {
-    for (; !stop; ++rounds, pause()) {
-      try {
-        N_Socket udp(loopback(), port() + 1, N_Socket::SOCKET_UDP);
-      } catch (Q_Exception* e) {
-        ADD_FAILURE() << "socket: " << e->getErrorMessage();
-      }
-    }
-  });
-  // An accepted socket makes its own address with the mutex held, and
-  // deletes it in its destruct, also with the mutex held.
+  // Sockets read their peer's identifier with the runtime's mutex held; an
+  // accepted one makes its own address with the mutex held, and deletes it in
+  // its destruct, also with the mutex held.
   N_Listener listener(port());
-  threads.emplace_back([&] {
-    for (; !stop; ++rounds) {
-      int client = raw::connectTo("127.0.0.1", port());
-      N_Socket::ConnectData* data = nullptr;
-      if (client >= 0 && waitFor([&] { return listener.pollConnect(data); })) {
-        try {
-          N_Socket accepted(data);
+  for (bool accepted : {false, true}) {
+    threads.emplace_back([&, accepted] {
+      for (; !stop; ++rounds, pause()) try {
+          const int client = accepted ? raw::connectTo("127.0.0.1", port()) : -1;
+          N_Socket::ConnectData* data = nullptr;
+          if (!accepted) N_Socket udp(loopback(), port() + 1, N_Socket::SOCKET_UDP);
+          if (client >= 0 && waitFor([&] { return listener.pollConnect(data); })) N_Socket in(data);
+          raw::closeFd(client);
         } catch (Q_Exception* e) {
-          ADD_FAILURE() << "accepted socket: " << e->getErrorMessage();
+          ADD_FAILURE() << e->getErrorMessage();
         }
-      }
-      raw::closeFd(client);
-    }
-  });
+    });
+  }
   // Addresses left for the stop to delete.
   threads.emplace_back([&] {
     for (int i = 0; i < 20 && !stop; ++i, sleepMs(20)) Q_New<N_Address>(i % 2 == 0 ? "localhost" : "127.0.0.1");
