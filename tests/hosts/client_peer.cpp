@@ -12,6 +12,13 @@
 //        MS after the one before (so each leaves in a message of its own),
 //        "sent COUNT" after the last; with "stamp" each is "PREFIX<i>@<NS>;",
 //        NS the steady clock in nanoseconds (the same in every process).
+//   probe MS | probe report | probe stop
+//        a payload "#N;" every MS to a server that echoes them; echoes must
+//        come back in order. "report" prints "probe-window COUNT P99_MS
+//        MAX_MS" of the round trips since the last report; "stop" ends the
+//        sending and, once every echo is back (or after 10 s), prints
+//        "probe-final SENT ECHOED DISORDER".
+#include <algorithm>
 #include <chrono>
 #include <cstdlib>
 #include <memory>
@@ -53,7 +60,49 @@ struct Sender {
   }
 };
 
-void run(N_Client& client, std::istringstream& in, const std::string& command, Sender* senders) {
+// Numbered payloads to an echoing server, and their round trips.
+struct Probe {
+  bool sending = false, stopping = false;
+  int spacingMs = 20;
+  std::vector<Clock::time_point> sentAt;  // by number
+  std::size_t expected = 0, echoed = 0, disorder = 0;
+  std::vector<double> window;  // round trips (ms) since the last report
+  Clock::time_point last, stoppedAt;
+
+  bool take(const std::string& text) {  // false if the batch holds no echoes
+    if (text.empty() || text[0] != '#') return false;
+    for (std::size_t at = 0, end; (end = text.find(';', at)) != std::string::npos; at = end + 1, ++echoed) {
+      const std::size_t n = std::strtoul(text.c_str() + at + 1, nullptr, 10);
+      disorder += n != expected;
+      if (n < sentAt.size()) window.push_back(std::chrono::duration<double, std::milli>(Clock::now() - sentAt[n]).count());
+      expected = n + 1;
+    }
+    return true;
+  }
+  void step(N_Client& client) {
+    const Clock::time_point now = Clock::now();
+    if (sending && now - last >= std::chrono::milliseconds(spacingMs))
+      queue(client, true, "#" + std::to_string(sentAt.size()) + ";"), sentAt.push_back(last = now);
+    if (!stopping || (echoed < sentAt.size() && now - stoppedAt < std::chrono::seconds(10))) return;
+    stopping = false;
+    say("probe-final " + std::to_string(sentAt.size()) + " " + std::to_string(echoed) + " " + std::to_string(disorder));
+  }
+  void command(const std::string& what) {
+    if (what == "report") {
+      std::sort(window.begin(), window.end());
+      const double p99 = window.empty() ? 0.0 : window[(window.size() * 99 + 99) / 100 - 1];
+      say("probe-window " + std::to_string(window.size()) + " " + std::to_string(p99) + " " +
+          std::to_string(window.empty() ? 0.0 : window.back()));
+      window.clear();
+    } else if (what == "stop") {
+      sending = false, stopping = true, stoppedAt = Clock::now();
+    } else {
+      spacingMs = std::atoi(what.c_str()), sending = true;
+    }
+  }
+};
+
+void run(N_Client& client, std::istringstream& in, const std::string& command, Sender* senders, Probe& probe) {
   if (command == "limits") {
     say("limits " + std::to_string(client.getLargestUnreliablePacketSize()));
   } else if (command == "stall") {
@@ -78,6 +127,10 @@ void run(N_Client& client, std::istringstream& in, const std::string& command, S
     std::string flag;
     in >> s.count >> s.prefix >> s.spacingMs >> flag;
     s.stamp = flag == "stamp";
+  } else if (command == "probe") {
+    std::string what;
+    in >> what;
+    probe.command(what);
   } else if (!command.empty()) {
     say("error unknown command " + command);
   }
@@ -108,6 +161,7 @@ int main(int argc, char** argv) {
     CommandInput input;
     Sender senders[2];  // reliable, unreliable
     senders[1].reliable = false;
+    Probe probe;
     for (; !input.finished(); std::this_thread::sleep_for(std::chrono::milliseconds(1))) {
       client->update();
       try {
@@ -116,14 +170,16 @@ int main(int argc, char** argv) {
           std::string command;
           in >> command;
           if (command == "quit") return client.reset(), say("bye"), 0;
-          run(*client, in, command, senders);
+          run(*client, in, command, senders, probe);
         }
         for (Sender& s : senders) s.step(*client);
+        probe.step(*client);
         void* message = nullptr;
         unsigned size = 0;
         while (client->poll(message, size))
-          say("recv " + std::to_string(size) + " " + std::string(static_cast<const char*>(message), size));
-        if (senders[0].count > 0 || senders[1].count > 0)
+          if (const std::string text(static_cast<const char*>(message), size); !probe.take(text))
+            say("recv " + std::to_string(size) + " " + text);
+        if (senders[0].count > 0 || senders[1].count > 0 || probe.sending || probe.stopping)
           client->flushReliable(), client->flushUnreliable();
       } catch (Q_Exception* e) {
         say(std::string("error ") + e->getErrorMessage());
