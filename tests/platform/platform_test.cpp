@@ -404,6 +404,7 @@ TEST(Faults, EveryCallFailsAsItsPlanSays) {
       {Call::AfxBeginThread, [&] { return errorIf(AfxBeginThread([](void*) { return 0u; }, nullptr) == nullptr); }},
   };
   ASSERT_EQ(static_cast<std::size_t>(Call::Count), calls.size());
+  EXPECT_EQ(nullptr, AfxBeginThread(nullptr, nullptr)) << "no procedure, no thread";
   for (const auto& [call, run] : calls) {
     SCOPED_TRACE(fault::name(call));
     FaultGuard faults(call, {.countdown = 2, .persist = false, .result = kCode});
