@@ -256,7 +256,7 @@ TEST_F(ClientScriptedTest, WithoutAServerOrAnAddress) {
   N_Client empty;
   for (int round = 0; round < 2; ++round) {
     EXPECT_TRUE(!empty.isConstructed() && !empty.isConnected() && empty.getAddress() == nullptr);
-    EXPECT_EQ(0u, empty.getPort() + empty.getLargestUnreliablePacketSize() + empty.getBandwidth());
+    EXPECT_TRUE(empty.getPort() == 0 && empty.getLargestUnreliablePacketSize() == 0 && empty.getBandwidth() == 0);
     empty.disconnect();
     empty.update();
     EXPECT_FALSE(empty.updateWorldTimer());
