@@ -2,20 +2,20 @@
 // bytes and the points at which it is cut into reads; each read is handed to
 // the receive path the way the network thread hands a completed WSARecv.
 //
-// Input layout: byte 0 = k (taken modulo 16), then k little-endian 16-bit
-// read sizes (each 1 to 65536, used in turn, again and again), then the
-// stream. With k = 0 the stream is read in one piece (65536 at most each).
+// Input: byte 0 = k (modulo 16; bit 4 picks the open network's limits), then
+// k little-endian 16-bit read sizes (each 1 to 65536, used in turn), then the
+// stream. With k = 0 the stream is read 65536 bytes at a time.
 //
-// Blocks above 16 MiB are refused here (see the allocation functions below):
-// a length near 2^31 would otherwise cost seconds of sanitizer bookkeeping
-// per input, and the refusal takes the library's out-of-memory path, which
-// deserves the fuzzing as much.
+// Blocks above 16 MiB are refused (see the allocation functions below): a
+// length near 2^31 would cost seconds of sanitizer bookkeeping per input, and
+// the refusal takes the library's out-of-memory path, which deserves the
+// fuzzing as much.
 //
 // Checked: nothing reads or writes outside its blocks (the sanitizers), the
-// messages that come out are exactly those a plain reference parser finds
-// (same order, sizes and bytes, those ahead of the first length that can't
-// be true), the progress getters agree with the reference, and every
-// allocation is given back once the socket goes.
+// messages are exactly those a plain reference parser finds (ahead of the
+// first length that can't be true), the progress getters agree with it, and
+// every allocation is given back once the socket goes.
+#include <algorithm>
 #include <atomic>
 #include <cstddef>
 #include <cstdint>
@@ -73,9 +73,9 @@ class FuzzSocket : public N_Socket {
     const auto* p = static_cast<const unsigned char*>(data);
     if (size > 0 && p == nullptr) std::abort();
     received.emplace_back(p, p + size);
-    bool keep = (received.size() & 1) != 0;
-    if (keep) kept.push_back(received.size() - 1);
-    return keep;
+    if (received.size() % 2 == 0) return false;
+    kept.push_back(received.size() - 1);
+    return true;
   }
   std::vector<Bytes> received;
   std::vector<std::size_t> kept;
@@ -92,8 +92,8 @@ Expected reference(const unsigned char* stream, std::size_t size, std::uint32_t 
   Expected e;
   std::size_t at = 0;
   while (size - at >= 4) {
-    std::uint32_t length = std::uint32_t(stream[at]) | std::uint32_t(stream[at + 1]) << 8 |
-                           std::uint32_t(stream[at + 2]) << 16 | std::uint32_t(stream[at + 3]) << 24;
+    const std::uint32_t length =
+        stream[at] | stream[at + 1] << 8 | stream[at + 2] << 16 | std::uint32_t{stream[at + 3]} << 24;
     if (length > maximumLength) {
       e.broken = true;
       return e;
@@ -132,53 +132,42 @@ void startOnce() {
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   startOnce();
   if (size == 0) return 0;
-  std::size_t k = data[0] % 16;
-  // Either set of limits: the largest length differs, and the open network's
-  // compact messages copy short ones and grow long ones as they arrive.
+  const std::size_t k = data[0] % 16, header = 1 + 2 * k;
+  // The largest length differs, and the open network's compact messages copy
+  // short ones and grow long ones as they arrive.
   N_Initializer::setLimits((data[0] & 16) != 0 ? N_Limits::openNetwork() : N_Limits::defaults());
   const std::uint32_t maximumLength = N_Initializer::getLimits().uMaximumMessageSize;
-  std::size_t header = 1 + 2 * k;
   if (size < header) return 0;
   std::vector<std::size_t> cuts;
   for (std::size_t i = 0; i < k; ++i) cuts.push_back(std::size_t(data[1 + 2 * i] | data[2 + 2 * i] << 8) + 1);
   if (cuts.empty()) cuts.push_back(65536);
   const unsigned char* stream = data + header;
-  std::size_t streamSize = size - header;
+  const std::size_t streamSize = size - header;
 
-  int newBefore = Q_Memory::sm_iNewCount.load();
-  int deleteBefore = Q_Memory::sm_iDeleteCount.load();
-  int refusedBefore = g_refusedBlocks.load();
+  const int newBefore = Q_Memory::sm_iNewCount.load(), deleteBefore = Q_Memory::sm_iDeleteCount.load(),
+            refusedBefore = g_refusedBlocks.load();
   {
     FuzzSocket socket;
     socket.construct(g_loopback, g_port, N_Socket::SOCKET_UDP);
     socket.enablePackage();
-    std::size_t at = 0;
-    std::size_t turn = 0;
-    while (at < streamSize) {
-      std::size_t piece = cuts[turn++ % cuts.size()];
-      if (piece > streamSize - at) piece = streamSize - at;
+    for (std::size_t at = 0, turn = 0, piece; at < streamSize; at += piece) {
+      piece = std::min(cuts[turn++ % cuts.size()], streamSize - at);
       N_SocketTestAccess::read(socket, stream + at, static_cast<unsigned int>(piece));
-      at += piece;
-      int missing = socket.getReceivePacketBytesMissing();
-      int total = socket.getReceivePacketSize();
+      const int missing = socket.getReceivePacketBytesMissing(), total = socket.getReceivePacketSize();
       if (missing < 0 || total < 0 || (total == 0) != (missing == 0) || (total > 0 && total - missing < 4))
         std::abort();
     }
 
-    Expected e = reference(stream, streamSize, maximumLength);
-    bool broken = N_SocketTestAccess::streamBroken(socket);
+    const Expected e = reference(stream, streamSize, maximumLength);
+    const bool broken = N_SocketTestAccess::streamBroken(socket);
     // A length that can't be true breaks the stream; so may a block that
     // can't be allocated, but only at a message that can't finish here.
     if (e.broken && !broken) std::abort();
     if (broken && !e.broken && e.partialSize == 0) std::abort();
     if (socket.received != e.messages) std::abort();
-    if (!broken) {
-      if (socket.getReceivePacketSize() != (e.partialHave >= 4 ? e.partialSize : 0)) std::abort();
-      if (socket.getReceivePacketBytesMissing() != (e.partialHave >= 4 ? e.partialSize - e.partialHave : 0))
-        std::abort();
-    } else if (socket.getReceivePacketSize() != 0) {
-      std::abort();
-    }
+    const bool whole = !broken && e.partialHave >= 4;  // a prefix read in full
+    if (socket.getReceivePacketSize() != (whole ? e.partialSize : 0)) std::abort();
+    if (!broken && socket.getReceivePacketBytesMissing() != (whole ? e.partialSize - e.partialHave : 0)) std::abort();
     // The kept messages come out of poll() whole and in order.
     for (std::size_t index : socket.kept) {
       void* message = nullptr;
@@ -189,10 +178,9 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
         std::abort();
     }
     void* none;
-    unsigned int noneSize;
-    if (socket.poll(none, noneSize)) std::abort();
+    if (unsigned int noneSize; socket.poll(none, noneSize)) std::abort();
   }
-  int refused = g_refusedBlocks.load() - refusedBefore;
+  const int refused = g_refusedBlocks.load() - refusedBefore;
   if (Q_Memory::sm_iNewCount.load() - newBefore - refused != Q_Memory::sm_iDeleteCount.load() - deleteBefore)
     std::abort();
   return 0;

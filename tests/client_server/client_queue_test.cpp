@@ -207,7 +207,7 @@ TEST_F(ClientQueueTest, AFailedAllocationLeavesTheQueueAsItWas) {
   for (const auto& [nth, step] : steps) {
     failAllocation(nth);
     EXPECT_THROW(step(), Q_MemoryException_Allocation*);
-    disarmFaults();
+    platform::fault::disarmAll();
     EXPECT_EQ(5u, waiting());
     EXPECT_EQ(0.0f, Access::nextFlushTime(client()));
   }
@@ -229,37 +229,24 @@ TEST_F(ClientQueueTest, QueuesIgnoreTheStateOfTheChannel) {
   EXPECT_EQ(0u, client().getUnreliableBytesWaiting());
 }
 
-// ---------------------------------------------------------------------------
-// Reading, with the simulated delay: each read with the delay on draws the
-// next gate from the shared generator. Loss is for the unreliable channel
-// only (the process test checks it); here it must leave reliable messages
-// alone.
-
-class ClientPollTest : public ClientQueueTest {
- protected:
-  std::vector<std::string> readAll() {
-    std::vector<std::string> out;
-    void* m = nullptr;
-    unsigned n = 0;
-    while (client().poll(m, n)) out.emplace_back(static_cast<const char*>(m), n);
-    return out;
-  }
-  // Sends and waits until the bytes have surely arrived, without polling.
-  void sendAndSettle(const std::vector<std::string>& messages) {
-    for (const auto& m : messages) peerSends(m);
-    sleepMs(150);
-  }
+// Reading with the simulated delay: each read with the delay on, a message or
+// not, draws the next gate from the thread's generator; a shut gate holds
+// messages and draws nothing. Loss is for the unreliable channel only (the
+// process test checks it): it leaves reliable messages alone.
+TEST_F(ClientQueueTest, ReadingWithTheSimulatedDelay) {
+  void* m = nullptr;
+  unsigned n = 0;
+  auto read = [&] { return client().poll(m, n) ? std::string(static_cast<const char*>(m), n) : "<none>"; };
   // The generator's first draws for `seed`, which is then set again.
-  static std::vector<int> draws(unsigned seed, int count = 1) {
+  auto draws = [](unsigned seed) {
     platform::srand(seed);
-    std::vector<int> out;
-    for (int i = 0; i < count; ++i) out.push_back(platform::rand());
+    std::vector<int> out = {platform::rand(), platform::rand(), platform::rand()};
     platform::srand(seed);
     return out;
-  }
-  // A read at an age between `before` and `after` must set the gate to
-  // the age plus the delay drawn from `r`.
-  void expectGate(int r, float before, float after, unsigned minimum, unsigned maximum) {
+  };
+  // A read between the ages `before` and now sets the gate to its age plus the delay drawn from `r`.
+  auto expectGate = [&](int r, float before, unsigned minimum, unsigned maximum) {
+    const float after = Access::sendAge(client());
     auto drawn = [&](float age) {
       const double u = static_cast<double>(r) * static_cast<double>(3.0518509e-05f);
       const double lo = minimum * static_cast<double>(0.001f), hi = maximum * static_cast<double>(0.001f);
@@ -267,59 +254,48 @@ class ClientPollTest : public ClientQueueTest {
     };
     EXPECT_GE(Access::nextPollTime(client()), drawn(before));
     EXPECT_LE(Access::nextPollTime(client()), drawn(after));
-  }
-};
-
-TEST_F(ClientPollTest, WithoutSimulationNothingIsDrawn) {
+  };
+  auto gateOpens = [&] { return waitFor([&] { return Access::sendAge(client()) >= Access::nextPollTime(client()); }); };
   N_Client::simulatePacketLoss(1.0f);
-  const int first = draws(11)[0];
-  sendAndSettle({"r1", "r2", "r3"});
-  EXPECT_EQ((std::vector<std::string>{"r1", "r2", "r3"}), readAll());
+  std::vector<int> sequence = draws(11);
+  for (const char* r : {"r1", "r2", "r3"}) peerSends(r);
+  sleepMs(150);  // arrived, surely
+  for (const char* r : {"r1", "r2", "r3"}) EXPECT_EQ(r, read());
   EXPECT_EQ(0.0f, Access::nextPollTime(client()));
-  EXPECT_EQ(first, platform::rand());
-}
+  EXPECT_EQ(sequence[0], platform::rand()) << "without the delay nothing is drawn";
 
-TEST_F(ClientPollTest, AShutGateHoldsMessagesAndDrawsNothing) {
   N_Client::simulateLatency(100, 100);
-  const std::vector<int> sequence = draws(5, 3);
-  const int first = sequence[0];
-  sendAndSettle({"m1", "m2", "m3"});
-  void* m = nullptr;
-  unsigned n = 0;
-  const float before = Access::sendAge(client());
-  ASSERT_TRUE(client().poll(m, n));
-  expectGate(first, before, Access::sendAge(client()), 100, 100);
-  EXPECT_EQ("m1", std::string(static_cast<const char*>(m), n));
+  sequence = draws(5);
+  for (const char* r : {"m1", "m2", "m3"}) peerSends(r);
+  sleepMs(150);
+  float before = Access::sendAge(client());
+  EXPECT_EQ("m1", read());
+  expectGate(sequence[0], before, 100, 100);
   float next = Access::nextPollTime(client());
-  EXPECT_FALSE(client().poll(m, n));
+  EXPECT_EQ("<none>", read());
   EXPECT_EQ(next, Access::nextPollTime(client()));
-  ASSERT_TRUE(waitFor([&] { return Access::sendAge(client()) >= next; }));
-  ASSERT_TRUE(client().poll(m, n));
-  EXPECT_EQ("m2", std::string(static_cast<const char*>(m), n));
+  ASSERT_TRUE(gateOpens());
+  EXPECT_EQ("m2", read());
   next = Access::nextPollTime(client());
   // Switched off: no new draws, but the last gate holds its time.
   N_Client::simulateLatency(0, 0);
-  EXPECT_FALSE(client().poll(m, n));
-  ASSERT_TRUE(waitFor([&] { return Access::sendAge(client()) >= next; }));
-  EXPECT_EQ(std::vector<std::string>{"m3"}, readAll());
+  EXPECT_EQ("<none>", read());
+  ASSERT_TRUE(gateOpens());
+  EXPECT_EQ("m3", read());
+  EXPECT_EQ("<none>", read());
   EXPECT_EQ(next, Access::nextPollTime(client()));
   EXPECT_EQ(sequence[2], platform::rand()) << "two reads drew";
-}
 
-TEST_F(ClientPollTest, EveryReadDrawsEvenWithoutAMessage) {
   // One end at 0 still switches the delay on; a maximum below the minimum
   // runs the draw from the minimum down.
-  const std::pair<unsigned, unsigned> ranges[] = {{0, 40}, {40, 0}, {100, 50}};
-  for (auto [minimum, maximum] : ranges) {
+  for (auto [minimum, maximum] : {std::pair{0u, 40u}, {40u, 0u}, {100u, 50u}}) {
     SCOPED_TRACE(testing::Message() << minimum << ".." << maximum);
     N_Client::simulateLatency(minimum, maximum);
     const int first = draws(77 + minimum)[0];
-    ASSERT_TRUE(waitFor([&] { return Access::sendAge(client()) >= Access::nextPollTime(client()); }));
-    void* m = nullptr;
-    unsigned n = 0;
-    const float before = Access::sendAge(client());
-    EXPECT_FALSE(client().poll(m, n));
-    expectGate(first, before, Access::sendAge(client()), minimum, maximum);
+    ASSERT_TRUE(gateOpens());
+    before = Access::sendAge(client());
+    EXPECT_EQ("<none>", read());
+    expectGate(first, before, minimum, maximum);
   }
 }
 

@@ -20,25 +20,18 @@ constexpr int kPayloads = 60;  // twenty instrumented processes share the cores
 constexpr int kPayloads = 300;
 #endif
 
-// The payloads "<prefix><i>;" in a batch.
-std::vector<std::string> split(const std::string& batch) {
-  std::vector<std::string> out;
-  std::size_t start = 0;
-  for (std::size_t end; (end = batch.find(';', start)) != std::string::npos; start = end + 1)
-    out.push_back(batch.substr(start, end - start));
-  return out;
-}
-
-// Every payload the server's end of a client can read now. With simulated
-// loss a false read doesn't mean that nothing is left, so it reads a fixed
-// number of times (a read that finds nothing draws nothing).
+// The payloads "<prefix><i>;" the server's end of a client can read now.
+// With simulated loss a false read doesn't mean that nothing is left, so it
+// reads a fixed number of times (a read that finds nothing draws nothing).
 std::vector<std::string> readPayloads(N_Client& client, int reads = 500) {
   std::vector<std::string> out;
   void* m = nullptr;
   unsigned n = 0;
-  for (int i = 0; i < reads; ++i)
-    if (client.poll(m, n))
-      for (std::string& p : split(std::string(static_cast<const char*>(m), n))) out.push_back(std::move(p));
+  for (int i = 0; i < reads; ++i) {
+    const std::string batch = client.poll(m, n) ? std::string(static_cast<const char*>(m), n) : "";
+    for (std::size_t at = 0, end; (end = batch.find(';', at)) != std::string::npos; at = end + 1)
+      out.push_back(batch.substr(at, end - at));
+  }
   return out;
 }
 
@@ -182,8 +175,8 @@ TEST_F(ClientServerProcessTest, SilentEndsAreDropped) {
   EXPECT_TRUE(waitFor([&] { return !cb->isConnected(); }, 3000, pump));
 }
 
-// One client host: datagram batches, simulated loss, then the world timer,
-// with a server that stops answering at the end.
+// One client host: datagram batches and simulated loss. (The world timer's
+// exchange is the scripted tests', byte by byte at both ends.)
 TEST_F(ClientServerProcessTest, OneClientOnItsOwnHost) {
   heartbeat(5.0f, 5.0f);
   N_Server server(port());
@@ -253,26 +246,6 @@ TEST_F(ClientServerProcessTest, OneClientOnItsOwnHost) {
   EXPECT_TRUE(std::is_sorted(kept[0].begin(), kept[0].end()));
   N_Client::simulatePacketLoss(0.0f);
 
-  // The world timer follows the server's: every round trip of the exchange
-  // was shorter than the whole of it.
-  peer.command("sync");
-  auto sync = peer.waitLine("sync", 10000, pump);
-  ASSERT_TRUE(sync);
-  ASSERT_EQ(0u, sync->find("sync 1 "));
-  const double took = std::atof(sync->c_str() + 7);
-  const double before = server.getWorldTimer().getAge();
-  peer.command("time");
-  auto time = peer.waitLine("time", 5000, pump);
-  ASSERT_TRUE(time);
-  EXPECT_GE(valueOf(*time), before - took);
-  EXPECT_LE(valueOf(*time), server.getWorldTimer().getAge() + took);
-  // No answers: false after the one second of the first exchange.
-  peer.command("sync");
-  sync = peer.waitLine("sync", 10000);
-  ASSERT_TRUE(sync);
-  EXPECT_EQ(0u, sync->find("sync 0 ")) << *sync;
-  EXPECT_GE(std::atof(sync->c_str() + 7), 1.0);
-  EXPECT_LT(std::atof(sync->c_str() + 7), 2.0);
   EXPECT_TRUE(peer.quit(10000, pump));
 }
 

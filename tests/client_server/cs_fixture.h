@@ -1,8 +1,8 @@
 // Shared pieces of the client and server tests: the runtime fixture with the
 // client settings put back, white-box hooks for the heartbeat timers and the
-// pacing gates, a scripted server end and a scripted client end made of plain
-// N_Sockets (for the exact bytes of the control channel), and client host
-// processes (for the unreliable channel and for several clients at once).
+// pacing gates, scripted server and client ends made of plain N_Sockets (for
+// the exact bytes of the control channel), and client host processes (for
+// the unreliable channel and for several clients at once).
 #pragma once
 
 #include <atomic>
@@ -11,7 +11,6 @@
 #include <mutex>
 #include <optional>
 #include <string>
-#include <string_view>
 #include <thread>
 #include <vector>
 
@@ -22,7 +21,6 @@
 #include "N_Server.h"
 #include "N_Socket.h"
 #include "child_process.h"
-#include "fault.h"
 #include "runtime_test.h"
 
 // Timer ages for the heartbeat limits and the pacing gates, which the public
@@ -52,11 +50,12 @@ namespace cs_test {
 using CM = ControlMessage;
 using Access = N_ClientTestAccess;
 using ServerAccess = N_ServerTestAccess;
+using Bytes = std::vector<unsigned char>;
 
-void sleepMs(int milliseconds);
-// A control message as raw bytes, cut to `size` when asked (the value word
-// is filled even for 4-byte types, so a cut message carries known bytes).
-std::vector<unsigned char> controlBytes(std::uint32_t type, std::uint32_t value = 0, int size = -1);
+inline void sleepMs(int milliseconds) { std::this_thread::sleep_for(std::chrono::milliseconds(milliseconds)); }
+// A control message as raw bytes, little-endian, cut to `size` when asked
+// (the value word is there even for 4-byte types, so a cut one carries known bytes).
+Bytes controlBytes(std::uint32_t type, std::uint32_t value = 0, int size = -1);
 std::string hostOf(const N_Client* client);
 
 // Heartbeats at 0.2 s / 0.2 s and the simulation off unless a test says
@@ -65,21 +64,22 @@ class ClientServerTest : public RuntimeTest {
  protected:
   void SetUp() override;
   void TearDown() override;
-  static void heartbeat(float frequency, float latency);
+  static void heartbeat(float frequency, float latency) {
+    N_Client::setHeartbeatFrequency(frequency);
+    N_Client::setHeartbeatLatency(latency);
+  }
 };
 
 // One received control message, as the scripted ends record it.
 struct Received {
   unsigned size;
-  std::uint32_t type;
-  std::uint32_t value;
-  double at;  // seconds since the scripted end started
+  std::uint32_t type, value;
 };
 
 // The server end played by plain sockets on a thread of its own: it accepts
 // the data connection on `port` and the control connection on 6000, records
-// every control and data message, and answers heartbeats and world-time
-// requests by its policy.
+// every control message, and answers heartbeats and world-time requests by
+// its policy.
 class ScriptedServer {
  public:
   explicit ScriptedServer(int port);
@@ -92,20 +92,14 @@ class ScriptedServer {
   std::vector<Received> control();
   std::size_t count(std::uint32_t type);
   bool connected(bool control);
-  bool sendControl(const std::vector<unsigned char>& bytes);
-  bool sendData(const std::string& bytes);
+  void sendControl(const Bytes& bytes);
   bool waitControl(std::size_t count, int milliseconds, const Pump& pump);
 
  private:
-  void run();
-
-  N_Listener m_dataListener;
-  N_Listener m_controlListener;
+  N_Listener m_dataListener, m_controlListener;
   std::mutex m_lock;
-  N_Socket* m_pData = nullptr;
-  N_Socket* m_pControl = nullptr;
-  std::vector<Received> m_control;
-  Clock::time_point m_start;
+  std::unique_ptr<N_Socket> m_data, m_control;
+  std::vector<Received> m_received;
   std::atomic<bool> m_bStop{false};
   std::thread m_thread;
 };
@@ -115,27 +109,25 @@ class ScriptedServer {
 class ScriptedClient {
  public:
   ScriptedClient(const N_Address* server, int port, bool openDataNow = true, bool openControlNow = true);
-  ~ScriptedClient();
-  void openData();
-  void openControl();
-  bool connected();
+  void openData() { m_data.emplace(m_pServer, m_iPort, N_Socket::SOCKET_TCP); }
+  void openControl() { m_control.emplace(m_pServer, CM::CONTROL_PORT, N_Socket::SOCKET_TCP); }
+  bool connected() { return m_data && m_data->isConnected() && m_control && m_control->isConnected(); }
+  bool closed() { return !m_data->isConnected() && !m_control->isConnected(); }
   void send(std::uint32_t type, std::uint32_t value = 0) { sendRaw(controlBytes(type, value)); }
-  void sendRaw(const std::vector<unsigned char>& bytes);
+  void sendRaw(const Bytes& bytes) {
+    m_control->send(const_cast<unsigned char*>(bytes.data()), unsigned(bytes.size()));
+  }
   std::optional<Received> next(int milliseconds, const Pump& pump);
-  // Every control message that arrives within the time.
-  std::vector<Received> drain(int milliseconds, const Pump& pump);
+  std::vector<Received> drain(int milliseconds, const Pump& pump);  // all that arrives within the time
   // The value of the last grant among what arrives within the time.
   std::optional<std::uint32_t> lastGrant(const Pump& pump, int milliseconds = 300);
-  N_Socket* data() { return m_pData; }
-  N_Socket* control() { return m_pControl; }
-  bool closed() { return !m_pData->isConnected() && !m_pControl->isConnected(); }
+  N_Socket* data() { return &*m_data; }
+  N_Socket* control() { return &*m_control; }
 
  private:
   const N_Address* m_pServer;
   int m_iPort;
-  N_Socket* m_pData = nullptr;
-  N_Socket* m_pControl = nullptr;
-  Clock::time_point m_start;
+  std::optional<N_Socket> m_data, m_control;
 };
 
 // update() then pollConnect() until false, keeping the clients handed out.
@@ -145,8 +137,7 @@ class ServerPump {
   explicit ServerPump(N_Server& server) : m_pServer(&server), m_announced(std::make_shared<std::vector<N_Client*>>()) {}
   void operator()() const {
     m_pServer->update();
-    N_Client* c = nullptr;
-    while (m_pServer->pollConnect(c)) m_announced->push_back(c);
+    for (N_Client* c = nullptr; m_pServer->pollConnect(c);) m_announced->push_back(c);
   }
   const std::vector<N_Client*>& announced() const { return *m_announced; }
   void forget(N_Client* client) const { std::erase(*m_announced, client); }
@@ -165,12 +156,10 @@ class PeerProcess {
   PeerProcess(int hostNumber, int port, std::vector<std::string> extra = {});
   const std::string& host() const { return m_host; }
   // Reads lines until one contains `text`, pumping meanwhile.
-  std::optional<std::string> waitLine(std::string_view text, int milliseconds, const Pump& pump = {});
-  bool command(std::string_view line) { return m_process.writeLine(line); }
-  // Sends "quit" and waits for the process to end with 0.
-  bool quit(int milliseconds, const Pump& pump = {});
-  // Waits for "connected" and the server's hand-out.
-  N_Client* admit(const ServerPump& pump);
+  std::optional<std::string> waitLine(const std::string& text, int milliseconds, const Pump& pump = {});
+  bool command(const std::string& line) { return m_process.writeLine(line); }
+  bool quit(int milliseconds, const Pump& pump = {});  // "quit", and the process ends with 0
+  N_Client* admit(const ServerPump& pump);             // "connected" and the server's hand-out
   ChildProcess& process() { return m_process; }
 
  private:

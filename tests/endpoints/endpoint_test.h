@@ -14,13 +14,6 @@
 #include "win32.h"
 #include "winsock.h"
 
-// Linux-side helpers that raw_socket.h doesn't give (raw_peer.cpp: Linux's
-// socket macros clash with the Winsock-shaped headers).
-namespace raw_peer {
-std::uint16_t localPort(int fd);
-void noDelay(int fd);  // small writes leave at once, each in a read of its own
-}  // namespace raw_peer
-
 // Feeds a read cut exactly so (or an error completion) to the receive path,
 // which loopback can't be made to do deterministically.
 struct N_SocketTestAccess {

@@ -131,12 +131,14 @@ TEST_F(SocketTest, ConnectAndDisconnectEvents) {
 }
 
 // receive() destroys its own socket, takes long while another thread
-// destroys it, or polls and declines, at the first of three messages of one
-// read: the rest is dropped, nothing touches a dead socket, destruct() waits
-// for the call, and a polled message is freed once (the balance tells).
+// destroys it, polls and declines, or throws, at the first of three messages
+// of one read. Nothing touches a dead socket and the rest is dropped;
+// destruct() waits for the call; a polled message is freed once (the balance
+// tells); an exception is dropped with a diagnostic line naming it, and its
+// message stays for poll() on a connection that goes on.
 class BusySocket : public N_Socket {
  public:
-  enum Mode { DESTRUCT, DELETE, SLOW, POLL } mode;
+  enum Mode { DESTRUCT, DELETE, SLOW, POLL, THROW } mode;
   explicit BusySocket(Mode m) : mode(m) {}
   ~BusySocket() { destruct(); }
   bool receive(void* data, unsigned size) override {
@@ -149,57 +151,42 @@ class BusySocket : public N_Socket {
     if (m == SLOW) platform::Sleep(200);
     while (m == POLL && poll(polled, polledSize)) own += polled == data && polledSize == size;
     ++finished;
+    if (m == THROW) throw 7;
     return m != POLL;
   }
-  static inline std::atomic<int> calls{0}, finished{0}, own{0};
+  static inline std::atomic<int> calls{0}, finished{0}, own{0}, traces{0};
 };
 
-TEST_F(SocketTest, ReceiveMayDestroyItsSocketOrPoll) {
+TEST_F(SocketTest, ReceiveMayDestroyItsSocketPollOrThrow) {
   using enum BusySocket::Mode;
+  Sys->setVerboseSink([](const char* line) { BusySocket::traces += std::strstr(line, "receive: ") != nullptr; });
   N_Listener listener(port());
-  for (BusySocket::Mode mode : {DESTRUCT, DELETE, SLOW, POLL}) {
+  for (BusySocket::Mode mode : {DESTRUCT, DELETE, SLOW, POLL, THROW}) {
     SCOPED_TRACE(mode);
-    BusySocket::calls = BusySocket::finished = BusySocket::own = 0;
+    BusySocket::calls = BusySocket::finished = BusySocket::own = BusySocket::traces = 0;
     auto* in = new BusySocket(mode);
     int fd = -1;
     ASSERT_TRUE(acceptRaw(listener, port(), *in, fd));
     ASSERT_TRUE(rawSend(fd, concat({framed(pattern(5, 1)), framed(pattern(6, 2)), framed(pattern(7, 3))})));
-    ASSERT_TRUE(waitFor([&] { return BusySocket::calls == (mode == POLL ? 3 : 1); }));
+    const int all = mode == POLL || mode == THROW ? 3 : 1;
+    ASSERT_TRUE(waitFor([&] { return BusySocket::calls == all; }));
     if (mode == SLOW) in->destruct();  // waits for the calls under way
     const int calls = BusySocket::calls;
     EXPECT_TRUE(mode != SLOW || BusySocket::finished == calls);
     pumpFor(50, {});
-    EXPECT_EQ(mode == SLOW ? calls : mode == POLL ? 3 : 1, BusySocket::calls.load());
+    EXPECT_EQ(mode == SLOW ? calls : all, BusySocket::calls.load());
     EXPECT_EQ(calls, BusySocket::finished.load());
     EXPECT_EQ(mode == POLL ? 3 : 0, BusySocket::own.load());
-    EXPECT_EQ(mode == POLL ? 1 : 0, registeredSockets());
+    EXPECT_EQ(mode == POLL || mode == THROW ? 1 : 0, registeredSockets());
+    EXPECT_EQ(mode == THROW ? 3 : 0, BusySocket::traces.load());
+    if (mode == THROW) {
+      for (unsigned i = 1; i <= 3; ++i) EXPECT_TRUE(nextMessage(*in, pattern(4 + i, i)));
+      EXPECT_TRUE(in->isConnected());
+    }
     if (mode != DELETE) delete in;
     raw::closeFd(fd);
   }
-}
-
-// An exception out of receive() is dropped with a diagnostic line naming
-// it; the message stays for poll() and the connection goes on.
-TEST_F(SocketTest, AThrowingReceiveLeavesATraceAndItsMessage) {
-  static std::atomic<int> traces{0};
-  Sys->setVerboseSink([](const char* line) { traces += std::strstr(line, "receive: ") != nullptr; });
-  struct Throwing : N_Socket {
-    ~Throwing() { destruct(); }
-    bool receive(void*, unsigned) override { throw 7; }
-  } in;
-  N_Listener listener(port());
-  int fd = -1;
-  ASSERT_TRUE(acceptRaw(listener, port(), in, fd));
-  ASSERT_TRUE(rawSend(fd, concat({framed(pattern(5, 1)), framed(pattern(6, 2))})));
-  Bytes got;
-  for (std::size_t size : {5u, 6u}) {
-    ASSERT_TRUE(pollMessage(in, got, 5000));
-    EXPECT_EQ(size, got.size());
-  }
-  EXPECT_EQ(2, traces.load());
-  EXPECT_TRUE(in.isConnected());
   Sys->setVerboseSink(nullptr);
-  raw::closeFd(fd);
 }
 
 // Sends still queued and reads still under way when their socket goes: the
@@ -252,10 +239,10 @@ TEST_F(SocketTest, ListenersQueueTheirConnectionsInOrder) {
   const int portB = freePort(), newPort = freePort();
   CountingListener a(port()), b(portB);
   N_Socket::ConnectData* entry = nullptr;
-  const int toB1 = raw::connectFrom("127.0.0.2", "127.0.0.1", portB);
+  const int toB1 = raw::connectTo("127.0.0.1", portB, "127.0.0.2");
   ASSERT_TRUE(waitFor([&] { return b.calls == 1; }));
-  const int toA = raw::connectFrom("127.0.0.3", "127.0.0.1", port());
-  const int toB2 = raw::connectFrom("127.0.0.4", "127.0.0.1", portB);
+  const int toA = raw::connectTo("127.0.0.1", port(), "127.0.0.3");
+  const int toB2 = raw::connectTo("127.0.0.1", portB, "127.0.0.4");
   ASSERT_TRUE(waitFor([&] { return a.calls == 1 && b.calls == 2; }));
   EXPECT_EQ(1, a.queuedFirst.load());
   EXPECT_EQ(1, b.queuedFirst.load());  // b's second entry waits behind its first
@@ -268,7 +255,7 @@ TEST_F(SocketTest, ListenersQueueTheirConnectionsInOrder) {
     EXPECT_EQ(listener, entry->pListener);
     N_Socket& in = *accepted.emplace_back(std::make_unique<N_Socket>(entry));
     EXPECT_TRUE(in.isConnected() && in.getSocketType() == N_Socket::SOCKET_TCP);
-    EXPECT_EQ(raw_peer::localPort(fd), in.getPort());
+    EXPECT_EQ(raw::localPort(fd), in.getPort());
     EXPECT_STREQ(from, const_cast<const char*>(in.getAddress()->getStringNumber()));
     raw::closeFd(fd);
   }
@@ -493,7 +480,7 @@ TEST_F(StreamTest, AnEndOrBreakInsideAMessageEndsOnlyItsConnection) {
     int badFd = -1, goodFd = -1;
     ASSERT_TRUE(acceptRaw(listener, port(), bad, badFd));
     ASSERT_TRUE(acceptRaw(listener, port(), good, goodFd));
-    raw_peer::noDelay(badFd);
+    raw::noDelay(badFd);
     write(badFd, concat({framed(a), framed(a), c.pieces[0]}));
     for (std::size_t i = 1; i < c.pieces.size(); ++i) write(badFd, c.pieces[i]);
     if (c.collecting >= 0) {

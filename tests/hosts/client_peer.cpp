@@ -1,34 +1,21 @@
-// One N_Client host for the client and server tests, driven line by line.
-//
-//   vardel_host_client_peer --host 127.0.0.2 --server 127.0.0.1 --port P
-//       [--hb-frequency F] [--hb-latency L]
-//
-// It makes its own runtime on --host, connects to the server and calls
-// update() in a loop of about a millisecond. It prints, one per line:
-//   connected / lost               isConnected() became true / false again
-//   bandwidth N                    getBandwidth() changed (once connected)
-//   latency X                      getLatency() changed
-//   recv N TEXT                    a message of N bytes (payloads are text)
-//   sync OK SECONDS                result and duration of updateWorldTimer()
-//   time AGE                       the world timer's age
-//   limits LARGEST                 getLargestUnreliablePacketSize()
-//   flushed / error TEXT           results of the commands
-//   bye                            at "quit", after the client is gone
-// Commands on standard input:
-//   quit | sync | time | limits | stall SECONDS | bandwidth N
+// One N_Client host for the client and server tests, driven line by line:
+//   vardel_host_client_peer --host 127.0.0.2 --server 127.0.0.1 --port P [--hb-frequency F] [--hb-latency L]
+// It makes its own runtime on --host, connects and calls update() about
+// every millisecond. It prints "connected" / "lost" as isConnected() changes,
+// "bandwidth N" and "latency X" as they change, "recv N TEXT" for each
+// message, "flushed", "error TEXT", and "bye" at "quit". Commands:
+//   limits                    prints "limits LARGEST", the largest unreliable size
+//   stall SECONDS | bandwidth N | fr | fu (flush reliable / unreliable once)
 //   qrn KEY PRIO SIZE CHAR | qun ...   queue SIZE copies of CHAR, reliable / unreliable
-//   fr | fu                            flush once
 //   send-r COUNT PREFIX [MS [stamp]] | send-u ...
-//        queue COUNT payloads "PREFIX<i>;" (i from 0), each once the queue
-//        is empty again and at least MS milliseconds after the one before,
-//        so each leaves in a message of its own; prints "sent COUNT" when the
-//        last is queued. With "stamp" each is "PREFIX<i>@<NS>;", NS the
-//        steady clock in nanoseconds (the same clock in every process).
+//        COUNT payloads "PREFIX<i>;", each once the queue is empty again and
+//        MS after the one before (so each leaves in a message of its own),
+//        "sent COUNT" after the last; with "stamp" each is "PREFIX<i>@<NS>;",
+//        NS the steady clock in nanoseconds (the same in every process).
 //   probe MS | probe report | probe stop
-//        queue a numbered payload "#N;" every MS milliseconds, for a server
-//        that echoes them back; echoes are taken out of the read and must
+//        a payload "#N;" every MS to a server that echoes them; echoes must
 //        come back in order. "report" prints "probe-window COUNT P99_MS
-//        MAX_MS" for the round trips since the last report; "stop" ends the
+//        MAX_MS" of the round trips since the last report; "stop" ends the
 //        sending and, once every echo is back (or after 10 s), prints
 //        "probe-final SENT ECHOED DISORDER".
 #include <algorithm>
@@ -43,7 +30,6 @@
 #include "N_Client.h"
 #include "N_Initializer.h"
 #include "Q_Exception.h"
-#include "Q_Timer.h"
 #include "peer_input.h"
 #include "vardel_platform.h"
 #include "win32.h"
@@ -53,20 +39,13 @@ namespace {
 using Clock = std::chrono::steady_clock;
 
 void queue(N_Client& client, bool reliable, std::string text, unsigned key = 0, unsigned priority = 1) {
-  if (reliable) client.queueReliable(text.data(), static_cast<unsigned>(text.size()), key, priority);
-  else client.queueUnreliable(text.data(), static_cast<unsigned>(text.size()), key, priority);
-}
-
-std::string number(const char* format, double value) {
-  char text[64];
-  std::snprintf(text, sizeof text, format, value);
-  return text;
+  (client.*(reliable ? &N_Client::queueReliable : &N_Client::queueUnreliable))(text.data(), unsigned(text.size()), key,
+                                                                            priority);
 }
 
 struct Sender {
-  bool reliable = true;
+  bool reliable = true, stamp = false;
   int count = 0, next = 0, spacingMs = 0;
-  bool stamp = false;
   std::string prefix;
   Clock::time_point last;
 
@@ -75,8 +54,7 @@ struct Sender {
     if (next >= count || waiting > 0 || Clock::now() - last < std::chrono::milliseconds(spacingMs)) return;
     last = Clock::now();
     std::string payload = prefix + std::to_string(next);
-    if (stamp)
-      payload += "@" + std::to_string(std::chrono::nanoseconds(last.time_since_epoch()).count());
+    if (stamp) payload += "@" + std::to_string(std::chrono::nanoseconds(last.time_since_epoch()).count());
     queue(client, reliable, payload + ";");
     if (++next == count) say("sent " + std::to_string(count));
   }
@@ -91,24 +69,20 @@ struct Probe {
   std::vector<double> window;  // round trips (ms) since the last report
   Clock::time_point last, stoppedAt;
 
-  // Takes the echoes out of a received batch; false if it holds none.
-  bool take(const std::string& text) {
+  bool take(const std::string& text) {  // false if the batch holds no echoes
     if (text.empty() || text[0] != '#') return false;
-    for (std::size_t at = 0, end; (end = text.find(';', at)) != std::string::npos; at = end + 1) {
+    for (std::size_t at = 0, end; (end = text.find(';', at)) != std::string::npos; at = end + 1, ++echoed) {
       const std::size_t n = std::strtoul(text.c_str() + at + 1, nullptr, 10);
       disorder += n != expected;
       if (n < sentAt.size()) window.push_back(std::chrono::duration<double, std::milli>(Clock::now() - sentAt[n]).count());
       expected = n + 1;
-      ++echoed;
     }
     return true;
   }
   void step(N_Client& client) {
     const Clock::time_point now = Clock::now();
-    if (sending && now - last >= std::chrono::milliseconds(spacingMs)) {
-      queue(client, true, "#" + std::to_string(sentAt.size()) + ";");
-      sentAt.push_back(last = now);
-    }
+    if (sending && now - last >= std::chrono::milliseconds(spacingMs))
+      queue(client, true, "#" + std::to_string(sentAt.size()) + ";"), sentAt.push_back(last = now);
     if (!stopping || (echoed < sentAt.size() && now - stoppedAt < std::chrono::seconds(10))) return;
     stopping = false;
     say("probe-final " + std::to_string(sentAt.size()) + " " + std::to_string(echoed) + " " + std::to_string(disorder));
@@ -117,28 +91,19 @@ struct Probe {
     if (what == "report") {
       std::sort(window.begin(), window.end());
       const double p99 = window.empty() ? 0.0 : window[(window.size() * 99 + 99) / 100 - 1];
-      say("probe-window " + std::to_string(window.size()) + number(" %.3f", p99) +
-          number(" %.3f", window.empty() ? 0.0 : window.back()));
+      say("probe-window " + std::to_string(window.size()) + " " + std::to_string(p99) + " " +
+          std::to_string(window.empty() ? 0.0 : window.back()));
       window.clear();
     } else if (what == "stop") {
-      sending = false;
-      stopping = true;
-      stoppedAt = Clock::now();
+      sending = false, stopping = true, stoppedAt = Clock::now();
     } else {
-      spacingMs = std::atoi(what.c_str());
-      sending = true;
+      spacingMs = std::atoi(what.c_str()), sending = true;
     }
   }
 };
 
 void run(N_Client& client, std::istringstream& in, const std::string& command, Sender* senders, Probe& probe) {
-  if (command == "sync") {
-    Q_Timer took;
-    const bool ok = client.updateWorldTimer();
-    say(std::string("sync ") + (ok ? "1" : "0") + number(" %.6f", took.getAge()));
-  } else if (command == "time") {
-    say(number("time %.6f", client.getWorldTimer().getAge()));
-  } else if (command == "limits") {
+  if (command == "limits") {
     say("limits " + std::to_string(client.getLargestUnreliablePacketSize()));
   } else if (command == "stall") {
     double seconds = 0;
@@ -197,44 +162,35 @@ int main(int argc, char** argv) {
     Sender senders[2];  // reliable, unreliable
     senders[1].reliable = false;
     Probe probe;
-    while (!input.finished()) {
+    for (; !input.finished(); std::this_thread::sleep_for(std::chrono::milliseconds(1))) {
       client->update();
       try {
         for (std::string line; input.next(line);) {
           std::istringstream in(line);
           std::string command;
           in >> command;
-          if (command == "quit") {
-            client.reset();
-            say("bye");
-            return 0;
-          }
+          if (command == "quit") return client.reset(), say("bye"), 0;
           run(*client, in, command, senders, probe);
         }
         for (Sender& s : senders) s.step(*client);
         probe.step(*client);
         void* message = nullptr;
         unsigned size = 0;
-        while (client->poll(message, size)) {
-          const std::string text(static_cast<const char*>(message), size);
-          if (!probe.take(text)) say("recv " + std::to_string(size) + " " + text);
-        }
-        if (senders[0].count > 0 || senders[1].count > 0 || probe.sending || probe.stopping) {
-          client->flushReliable();
-          client->flushUnreliable();
-        }
+        while (client->poll(message, size))
+          if (const std::string text(static_cast<const char*>(message), size); !probe.take(text))
+            say("recv " + std::to_string(size) + " " + text);
+        if (senders[0].count > 0 || senders[1].count > 0 || probe.sending || probe.stopping)
+          client->flushReliable(), client->flushUnreliable();
       } catch (Q_Exception* e) {
         say(std::string("error ") + e->getErrorMessage());
       }
       if (client->isConnected() != connected) {
-        connected = !connected;
+        connected = !connected, lastBandwidth = 0;
         say(connected ? "connected" : "lost");
-        lastBandwidth = 0;
       }
       if (connected && client->getBandwidth() != lastBandwidth)
         say("bandwidth " + std::to_string(lastBandwidth = client->getBandwidth()));
-      if (client->getLatency() != lastLatency) say(number("latency %.6f", lastLatency = client->getLatency()));
-      std::this_thread::sleep_for(std::chrono::milliseconds(1));
+      if (client->getLatency() != lastLatency) say("latency " + std::to_string(lastLatency = client->getLatency()));
     }
     return 0;
   } catch (Q_Exception* e) {

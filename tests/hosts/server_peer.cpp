@@ -1,21 +1,13 @@
-// One N_Server host for tests that watch the traffic from outside (a capture),
-// driven line by line.
-//
+// One N_Server host for tests that watch the traffic from outside (a capture):
 //   vardel_host_server_peer --host 127.0.0.1 --port P [--hb-frequency F] [--hb-latency L]
-//
-// It makes its own runtime on --host, serves on data port P (and the fixed
-// control port) and calls update() in a loop of about a millisecond. It
-// prints, one per line:
-//   ready                          runtime up, server constructed
-//   client ADDRESS                 a client was paired
-//   recv N TEXT                    a message of N bytes from a client (TEXT: its first 24 bytes)
-//   done                           a command below finished
-//   bye                            at "quit" or the end of input
-// Commands on standard input:
-//   quit | maximum N               setMaximumBandwidthUsage(N)
-//   burst COUNT PREFIX             COUNT reliable messages "PREFIX<i>;" to every client, each
-//                                  flushed on its own while the network thread is held, so
-//                                  they all leave in one write (one TCP segment)
+// It serves on data port P (and the control port), calls update() about
+// every millisecond and prints "ready", "client ADDRESS" for each pairing,
+// "recv N TEXT" for each message (TEXT: its first 24 bytes), "done" after a
+// command and "bye" at the end. Commands: quit | maximum N
+// (setMaximumBandwidthUsage) | burst COUNT PREFIX (COUNT reliable messages
+// "PREFIX<i>;" to every client, each flushed on its own while the network
+// thread is held, so that they all leave in one write).
+#include <algorithm>
 #include <chrono>
 #include <cstdlib>
 #include <sstream>
@@ -30,29 +22,6 @@
 #include "peer_input.h"
 #include "vardel_platform.h"
 #include "win32.h"
-
-namespace {
-
-void burst(const std::vector<N_Client*>& clients, int count, const std::string& prefix) {
-  // The runtime's mutex is a named one: holding it keeps the network thread
-  // from sending until every message is queued.
-  platform::HANDLE runtime = platform::CreateMutexA(nullptr, platform::FALSE, "Kelvane network mutex");
-  platform::WaitForSingleObject(runtime, platform::INFINITE);
-  for (N_Client* client : clients) {
-    for (int i = 0; i < count; ++i) {
-      std::string payload = prefix + std::to_string(i) + ";";
-      client->queueReliable(payload.data(), static_cast<unsigned>(payload.size()), 0, 1);
-      // The flush gate stays shut for bytes / bandwidth after each message.
-      const auto limit = std::chrono::steady_clock::now() + std::chrono::seconds(5);
-      while (client->getReliableBytesWaiting() > 0 && std::chrono::steady_clock::now() < limit)
-        client->flushReliable();
-    }
-  }
-  platform::ReleaseMutex(runtime);
-  platform::CloseHandle(runtime);
-}
-
-}  // namespace
 
 int main(int argc, char** argv) {
   std::string host = "127.0.0.1";
@@ -72,41 +41,45 @@ int main(int argc, char** argv) {
     std::vector<N_Client*> clients;
     CommandInput input;
     say("ready");
-    while (!input.finished()) {
+    for (; !input.finished(); std::this_thread::sleep_for(std::chrono::milliseconds(1))) {
       server.update();
-      N_Client* joined;
-      while (server.pollConnect(joined)) {
+      for (N_Client* joined; server.pollConnect(joined);) {
         clients.push_back(joined);
         say(std::string("client ") + const_cast<const char*>(joined->getAddress()->getStringNumber()));
       }
-      for (N_Client* client : clients) {
-        void* message;
-        unsigned size;
+      void* message;
+      unsigned size;
+      for (N_Client* client : clients)
         while (client->poll(message, size))
-          say("recv " + std::to_string(size) + " " + std::string(static_cast<const char*>(message), size < 24 ? size : 24));
-      }
+          say("recv " + std::to_string(size) + " " + std::string(static_cast<char*>(message), std::min(size, 24u)));
       for (std::string line; input.next(line);) {
         std::istringstream in(line);
-        std::string command;
-        in >> command;
+        std::string command, prefix;
+        unsigned value = 0;
+        in >> command >> value >> prefix;
         if (command == "quit") {
           input.close();
         } else if (command == "maximum") {
-          unsigned value = 0;
-          in >> value;
-          server.setMaximumBandwidthUsage(value);
-          say("done");
+          server.setMaximumBandwidthUsage(value), say("done");
         } else if (command == "burst") {
-          int count = 0;
-          std::string prefix;
-          in >> count >> prefix;
-          burst(clients, count, prefix);
-          say("done");
+          // The runtime's mutex is a named one: holding it keeps the network
+          // thread from sending until every message is queued.
+          platform::HANDLE runtime = platform::CreateMutexA(nullptr, platform::FALSE, "Kelvane network mutex");
+          platform::WaitForSingleObject(runtime, platform::INFINITE);
+          for (N_Client* client : clients)
+            for (unsigned i = 0; i < value; ++i) {
+              std::string payload = prefix + std::to_string(i) + ";";
+              client->queueReliable(payload.data(), static_cast<unsigned>(payload.size()), 0, 1);
+              // The flush gate stays shut for bytes / bandwidth after each message.
+              for (auto limit = std::chrono::steady_clock::now() + std::chrono::seconds(5);
+                   client->getReliableBytesWaiting() > 0 && std::chrono::steady_clock::now() < limit;)
+                client->flushReliable();
+            }
+          platform::ReleaseMutex(runtime), platform::CloseHandle(runtime), say("done");
         } else if (!command.empty()) {
           say("error unknown command " + command);
         }
       }
-      std::this_thread::sleep_for(std::chrono::milliseconds(1));
     }
     for (N_Client* client : clients) server.disconnectClient(client);
     say("bye");

@@ -16,11 +16,9 @@
 #include "vardel_platform.h"
 #include "win32.h"
 
-namespace {
-
 using Clock = std::chrono::steady_clock;
 
-int run(int port) {
+static int run(int port) {
   platform::setLocalHost("127.0.0.2");
   N_Initializer network;
   N_Address test("127.0.0.1");
@@ -33,14 +31,12 @@ int run(int port) {
     unsigned size = 0;
     N_Socket* from = tcp.poll(data, size) ? &tcp : udp.poll(data, size) ? &udp : nullptr;
     if (from == &tcp && size == 4 && std::memcmp(data, "quit", 4) == 0) break;
-    if (from != nullptr) {
-      from->send(data, size);
-      lastHeard = Clock::now();
-    } else if (!tcp.isConnected() || Clock::now() - lastHeard > std::chrono::seconds(30)) {
+    if (from != nullptr)
+      from->send(data, size), lastHeard = Clock::now();
+    else if (!tcp.isConnected() || Clock::now() - lastHeard > std::chrono::seconds(30))
       return 2;
-    } else {
+    else
       platform::Sleep(1);
-    }
   }
   // Everything sent leaves before the connection ends.
   for (auto start = Clock::now(); tcp.getBytesWaitingForSend() > 0 && Clock::now() - start < std::chrono::seconds(20);)
@@ -49,13 +45,9 @@ int run(int port) {
   return 0;
 }
 
-}  // namespace
-
-int main(int argc, char** argv) {
-  try {
-    return argc == 3 && std::strcmp(argv[1], "--port") == 0 ? run(std::atoi(argv[2])) : 3;
-  } catch (Q_Exception* e) {
-    std::fprintf(stderr, "transport_peer: %s\n", e->getErrorMessage());
-    return 3;
-  }
+int main(int argc, char** argv) try {
+  return argc == 3 && std::strcmp(argv[1], "--port") == 0 ? run(std::atoi(argv[2])) : 3;
+} catch (Q_Exception* e) {
+  std::fprintf(stderr, "transport_peer: %s\n", e->getErrorMessage());
+  return 3;
 }

@@ -1,7 +1,5 @@
-// The Winsock-shaped platform layer on Linux: network events follow Winsock's
-// recording rules; overlapped sends and reads complete once each, in order,
-// on the issuing thread and only inside its alertable waits; waits, mutexes,
-// threads, rand, names, and the fault plans of every call.
+// The Winsock-shaped platform layer on Linux: network events, overlapped
+// sends and reads, waits, mutexes, rand, names, and every call's fault plan.
 #include <gtest/gtest.h>
 
 #include <atomic>
@@ -45,10 +43,8 @@ SOCKET makeListener(std::uint16_t& port) {
 }
 
 struct Winsock {
-  Winsock() {
-    WSADATA data;
-    EXPECT_EQ(0, WSAStartup(0x0002, &data));
-  }
+  WSADATA data;
+  Winsock() { EXPECT_EQ(0, WSAStartup(0x0002, &data)); }
   ~Winsock() { WSACleanup(); }
 };
 
@@ -70,9 +66,9 @@ struct EventLog {
       if (ne.lNetworkEvents & (1L << bit)) errors[bit] = ne.iErrorCode[bit], ++counts[bit];
     return ne.lNetworkEvents;
   }
-  // Waits alertably until every one of `bits` has been seen since `seen` was cleared.
-  bool await(long bits) {
-    return waitFor([&] { return (take(), seen & bits) == bits; }, 5000, [&] { WSAWaitForMultipleEvents(1, &event, FALSE, 50, TRUE); });
+  bool await(long bits) {  // alertably, until all of `bits` were seen since `seen` was cleared
+    return waitFor([&] { return (take(), seen & bits) == bits; }, 5000,
+                   [&] { WSAWaitForMultipleEvents(1, &event, FALSE, 50, TRUE); });
   }
   bool quiet() { return WSAWaitForMultipleEvents(1, &event, FALSE, 100, TRUE) == WSA_WAIT_TIMEOUT; }
 };
@@ -188,6 +184,8 @@ TEST(EventSelect, EachEventIsRecordedOnceUntilReEnabled) {
   EXPECT_EQ(WSAECONNREFUSED, refused.errors[FD_CONNECT_BIT]);
   EXPECT_TRUE(refused.quiet());
   EXPECT_EQ(FD_CONNECT, refused.seen | refused.take());
+  EXPECT_EQ(SOCKET_ERROR, WSAEnumNetworkEvents(refused.socket, refused.event, nullptr));
+  EXPECT_EQ(WSAEFAULT, WSAGetLastError()) << "nowhere to write the events";
   Record never;
   EXPECT_EQ(SOCKET_ERROR, post(true, refused.socket, "x", 1, never));
   EXPECT_EQ(WSAENOTCONN, WSAGetLastError());
@@ -275,6 +273,9 @@ TEST(Overlapped, ManySendsArriveIntactAndCompleteInOrder) {
   closesocket(c.server->socket);
   ASSERT_TRUE(settles(cut[3]));
   EXPECT_TRUE(cut[3].error != 0 && cut[3].bytes < payload.size()) << cut[3].error;
+  Record late;
+  EXPECT_TRUE(post(true, c.client.socket, "x", 1, late) == SOCKET_ERROR && WSAGetLastError() != WSA_IO_PENDING)
+      << "a broken stream refuses further sends at once";
 }
 
 TEST(Wait, GivesTheLowestSignalledIndexAndEventsStaySetUntilReset) {
@@ -538,10 +539,12 @@ TEST(Faults, EveryCallFailsAsItsPlanSays) {
       {Call::AfxBeginThread, [&] { return errorIf(AfxBeginThread([](void*) { return 0u; }, nullptr) == nullptr); }},
   };
   ASSERT_EQ(static_cast<std::size_t>(Call::Count), calls.size());
+  EXPECT_EQ(nullptr, AfxBeginThread(nullptr, nullptr)) << "no procedure, no thread";
   for (const auto& [call, run] : calls) {
     SCOPED_TRACE(fault::name(call));
     FaultGuard faults(call, {.countdown = 2, .persist = false, .result = kCode});
     EXPECT_NE(kCode, run());
+    WSASetLastError(0);  // the code must come from this failure, not an earlier one
     EXPECT_EQ(kCode, run());
     EXPECT_NE(kCode, run());
     EXPECT_EQ(1, fault::fired(call));

@@ -3,7 +3,6 @@
 // two locks) and address resolution over this machine's real name service.
 // Expectations come from the platform's own lookups, not from how the hosts
 // file names 127.0.0.1.
-#include <dirent.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -11,20 +10,16 @@
 #include <cstdio>
 #include <cstring>
 #include <ctime>
-#include <functional>
+#include <filesystem>
 #include <ostream>
 #include <string>
 #include <thread>
 #include <vector>
 
-#include "N_Address.h"
 #include "N_Exceptions.h"
-#include "N_Initializer.h"
 #include "N_Listener.h"
 #include "N_Socket.h"
 #include "Q_New.h"
-#include "allocation_balance.h"
-#include "guards.h"
 #include "fault_sweep.h"
 #include "raw_socket.h"
 #include "runtime_test.h"
@@ -37,15 +32,9 @@ using platform::DWORD;
 using platform::WSAPROTOCOL_INFOA;
 using platform::fault::Call;
 
-// The threads of this process, as /proc/self/task lists them (the runtime's
-// threads have no names).
+// The threads of this process (the runtime's threads have no names).
 int threadCount() {
-  int count = 0;
-  if (DIR* dir = ::opendir("/proc/self/task")) {
-    while (dirent* entry = ::readdir(dir)) count += entry->d_name[0] != '.';
-    ::closedir(dir);
-  }
-  return count;
+  return static_cast<int>(std::distance(std::filesystem::directory_iterator("/proc/self/task"), {}));
 }
 // Sanitizers start a helper thread with the process's first thread; starting
 // one at load makes that happen before any test counts.
@@ -75,8 +64,7 @@ constexpr const char* kNotResolved = "IP address is not resolved yet";
 
 WSAPROTOCOL_INFOA entry(int family, DWORD flags) {
   WSAPROTOCOL_INFOA info{};
-  info.iAddressFamily = family;
-  info.dwServiceFlags1 = flags;
+  info.iAddressFamily = family, info.dwServiceFlags1 = flags;
   return info;
 }
 Arm startup(int code) { return [=](FaultGuard& f) { f.arm(Call::WSAStartup, {1, false, code}); }; }
@@ -230,33 +218,23 @@ TEST_F(RuntimeLife, LockOrderHoldsOnAllPathsAtOnce) {
     }
     platform::CloseHandle(mutex);
   });
-  // Sockets read their peer's identifier with the runtime's mutex held.
-  threads.emplace_back([&] {
-    for (; !stop; ++rounds, pause()) {
-      try {
-        N_Socket udp(loopback(), port() + 1, N_Socket::SOCKET_UDP);
-      } catch (Q_Exception* e) {
-        ADD_FAILURE() << "socket: " << e->getErrorMessage();
-      }
-    }
-  });
-  // An accepted socket makes its own address with the mutex held, and
-  // deletes it in its destruct, also with the mutex held.
+  // Sockets read their peer's identifier with the runtime's mutex held; an
+  // accepted one makes its own address with the mutex held, and deletes it in
+  // its destruct, also with the mutex held.
   N_Listener listener(port());
-  threads.emplace_back([&] {
-    for (; !stop; ++rounds) {
-      int client = raw::connectTo("127.0.0.1", port());
-      N_Socket::ConnectData* data = nullptr;
-      if (client >= 0 && waitFor([&] { return listener.pollConnect(data); })) {
-        try {
-          N_Socket accepted(data);
+  for (bool accepted : {false, true}) {
+    threads.emplace_back([&, accepted] {
+      for (; !stop; ++rounds, pause()) try {
+          const int client = accepted ? raw::connectTo("127.0.0.1", port()) : -1;
+          N_Socket::ConnectData* data = nullptr;
+          if (!accepted) N_Socket udp(loopback(), port() + 1, N_Socket::SOCKET_UDP);
+          if (client >= 0 && waitFor([&] { return listener.pollConnect(data); })) N_Socket in(data);
+          raw::closeFd(client);
         } catch (Q_Exception* e) {
-          ADD_FAILURE() << "accepted socket: " << e->getErrorMessage();
+          ADD_FAILURE() << e->getErrorMessage();
         }
-      }
-      raw::closeFd(client);
-    }
-  });
+    });
+  }
   // Addresses left for the stop to delete.
   threads.emplace_back([&] {
     for (int i = 0; i < 20 && !stop; ++i, sleepMs(20)) Q_New<N_Address>(i % 2 == 0 ? "localhost" : "127.0.0.1");

@@ -7,161 +7,79 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <cerrno>
+#include <algorithm>
 #include <chrono>
-#include <cstring>
-#include <mutex>
 #include <thread>
 
 extern char** environ;
 
-namespace {
-
 using Clock = std::chrono::steady_clock;
 
-int remainingMs(Clock::time_point deadline) {
-  auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - Clock::now()).count();
-  return left > 0 ? static_cast<int>(left) : 0;
-}
-
-void closeFd(int& fd) {
-  if (fd >= 0) ::close(fd);
-  fd = -1;
-}
-
-}  // namespace
-
 ChildProcess::ChildProcess(const std::string& program, const std::vector<std::string>& args) {
-  // A child that ends before reading its input must not kill the test.
-  static std::once_flag ignorePipe;
-  std::call_once(ignorePipe, [] { ::signal(SIGPIPE, SIG_IGN); });
-
-  // Close-on-exec everywhere, so that no other child inherits these pipes
-  // and keeps them open; dup2 into 0 and 1 clears the flag for this child.
-  int output[2];
-  int input[2];
-  if (::pipe2(output, O_CLOEXEC) != 0) {
-    m_startError = std::strerror(errno);
-    return;
+  ::signal(SIGPIPE, SIG_IGN);  // a child that ends before reading its input must not end the test
+  // Close-on-exec, so that no other child keeps these pipes open; dup2 clears it for this one.
+  int output[2] = {-1, -1}, input[2] = {-1, -1};
+  if (::pipe2(output, O_CLOEXEC) == 0 && ::pipe2(input, O_CLOEXEC) == 0) {
+    posix_spawn_file_actions_t actions;
+    posix_spawn_file_actions_init(&actions);
+    posix_spawn_file_actions_adddup2(&actions, output[1], STDOUT_FILENO);
+    posix_spawn_file_actions_adddup2(&actions, input[0], STDIN_FILENO);
+    std::vector<char*> argv{const_cast<char*>(program.c_str())};
+    for (const std::string& a : args) argv.push_back(const_cast<char*>(a.c_str()));
+    argv.push_back(nullptr);
+    pid_t pid = -1;
+    if (::posix_spawn(&pid, program.c_str(), &actions, nullptr, argv.data(), environ) == 0) m_pid = pid;
+    posix_spawn_file_actions_destroy(&actions);
   }
-  if (::pipe2(input, O_CLOEXEC) != 0) {
-    m_startError = std::strerror(errno);
-    ::close(output[0]);
-    ::close(output[1]);
-    return;
-  }
-
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  posix_spawn_file_actions_adddup2(&actions, output[1], STDOUT_FILENO);
-  posix_spawn_file_actions_adddup2(&actions, input[0], STDIN_FILENO);
-
-  std::vector<char*> argv;
-  argv.push_back(const_cast<char*>(program.c_str()));
-  for (const std::string& a : args) argv.push_back(const_cast<char*>(a.c_str()));
-  argv.push_back(nullptr);
-
-  pid_t pid = -1;
-  int rc = ::posix_spawn(&pid, program.c_str(), &actions, nullptr, argv.data(), environ);
-  posix_spawn_file_actions_destroy(&actions);
-  ::close(output[1]);
-  ::close(input[0]);
-  if (rc != 0) {
-    m_startError = std::strerror(rc);
-    ::close(output[0]);
-    ::close(input[1]);
-    return;
-  }
-  m_pid = pid;
+  for (int fd : {output[1], input[0]}) ::close(fd);
   m_iOutput = output[0];
   m_iInput = input[1];
 }
 
 ChildProcess::~ChildProcess() {
-  closeInput();
-  if (m_pid > 0 && !m_exitStatus) {
-    kill(SIGKILL);
-    // SIGKILL can't be refused; the wait only covers the time to die.
-    if (!wait(10000)) ::waitpid(m_pid, nullptr, 0);
-  }
-  closeFd(m_iOutput);
+  ::close(m_iInput);
+  if (started() && !wait(0)) ::kill(m_pid, SIGKILL), ::waitpid(m_pid, nullptr, 0);
+  ::close(m_iOutput);
 }
 
 std::optional<std::string> ChildProcess::readLine(int timeoutMs) {
-  auto deadline = Clock::now() + std::chrono::milliseconds(timeoutMs);
+  const auto deadline = Clock::now() + std::chrono::milliseconds(timeoutMs);
   for (;;) {
-    std::size_t end = m_pending.find('\n');
-    if (end != std::string::npos) {
-      std::string line = m_pending.substr(0, end);
+    if (const std::size_t end = m_pending.find('\n'); end != std::string::npos) {
+      m_lines.push_back(m_pending.substr(0, end));
       m_pending.erase(0, end + 1);
-      if (!line.empty() && line.back() == '\r') line.pop_back();
-      m_lines.push_back(line);
-      return line;
+      return m_lines.back();
     }
-    if (m_bEndOfOutput || m_iOutput < 0) {
-      if (m_pending.empty()) return std::nullopt;
-      std::string line;
-      line.swap(m_pending);
-      m_lines.push_back(line);
-      return line;
-    }
+    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - Clock::now()).count();
     pollfd p{m_iOutput, POLLIN, 0};
-    int ready = ::poll(&p, 1, remainingMs(deadline));
-    if (ready < 0 && errno == EINTR) continue;
-    if (ready <= 0) return std::nullopt;
     char buffer[4096];
-    ssize_t got = ::read(m_iOutput, buffer, sizeof buffer);
-    if (got < 0 && errno == EINTR) continue;
-    if (got <= 0) {
-      m_bEndOfOutput = true;
-      continue;
-    }
+    if (::poll(&p, 1, static_cast<int>(std::max<long>(left, 0))) <= 0) return std::nullopt;
+    const ssize_t got = ::read(m_iOutput, buffer, sizeof buffer);
+    if (got <= 0) return std::nullopt;
     m_pending.append(buffer, static_cast<std::size_t>(got));
   }
 }
 
-std::optional<std::string> ChildProcess::waitForLine(std::string_view text, int timeoutMs) {
-  auto deadline = Clock::now() + std::chrono::milliseconds(timeoutMs);
-  for (;;) {
-    std::optional<std::string> line = readLine(remainingMs(deadline));
-    if (!line) return std::nullopt;
-    if (line->find(text) != std::string::npos) return line;
-  }
-}
-
-bool ChildProcess::writeLine(std::string_view line) {
-  if (m_iInput < 0) return false;
-  std::string data(line);
-  data.push_back('\n');
-  std::size_t done = 0;
-  while (done < data.size()) {
-    ssize_t put = ::write(m_iInput, data.data() + done, data.size() - done);
-    if (put < 0 && errno == EINTR) continue;
+bool ChildProcess::writeLine(const std::string& line) {
+  const std::string data = line + "\n";
+  for (std::size_t done = 0; done < data.size();) {
+    const ssize_t put = ::write(m_iInput, data.data() + done, data.size() - done);
     if (put <= 0) return false;
     done += static_cast<std::size_t>(put);
   }
   return true;
 }
 
-void ChildProcess::closeInput() { closeFd(m_iInput); }
-
 std::optional<int> ChildProcess::wait(int timeoutMs) {
-  if (m_exitStatus) return m_exitStatus;
-  if (m_pid <= 0) return std::nullopt;
-  auto deadline = Clock::now() + std::chrono::milliseconds(timeoutMs);
-  for (;;) {
-    int status = 0;
-    pid_t done = ::waitpid(m_pid, &status, WNOHANG);
-    if (done == m_pid) {
+  const auto deadline = Clock::now() + std::chrono::milliseconds(timeoutMs);
+  int status = 0;
+  while (!m_exitStatus && started()) {
+    if (::waitpid(m_pid, &status, WNOHANG) == m_pid)
       m_exitStatus = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-      return m_exitStatus;
-    }
-    if (done < 0 && errno != EINTR) return std::nullopt;
-    if (Clock::now() >= deadline) return std::nullopt;
-    std::this_thread::sleep_for(std::chrono::milliseconds(2));
+    else if (Clock::now() >= deadline)
+      break;
+    else
+      std::this_thread::sleep_for(std::chrono::milliseconds(2));
   }
-}
-
-void ChildProcess::kill(int signal) {
-  if (m_pid > 0 && !m_exitStatus) ::kill(m_pid, signal);
+  return m_exitStatus;
 }

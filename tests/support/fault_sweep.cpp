@@ -3,28 +3,22 @@
 #include <string>
 
 #include "N_Exceptions.h"
-#include "allocation_balance.h"
-#include "guards.h"
 #include "runtime_test.h"
 
 namespace {
 
-// Arms the fault of run `n`; after the run, tells how many times it fired
-// and how many of those were refused allocations.
-struct Fault {
-  std::function<void(FaultGuard&, int n)> arm;
-  std::function<int()> fired;
-  bool allocations;
-};
-
-::testing::AssertionResult sweep(const Fault& fault, const std::function<void()>& scenario, int maxRuns) {
+// Runs the scenario with fault N armed by `arm`, N = 1, 2, ... until a run
+// meets no fault (`fired` tells how often it fired).
+::testing::AssertionResult sweep(const std::function<void(int n)>& arm, const std::function<int()>& fired,
+                                 const std::function<void()>& scenario, int maxRuns) {
   for (int n = 1; n <= maxRuns; ++n) {
     AllocationBalance balance;
+    const int refusedBefore = refusedAllocations();
     int hits = 0;
     std::string error;
     {
       FaultGuard guard;
-      fault.arm(guard, n);
+      arm(n);
       try {
         scenario();
       } catch (Q_Exception* e) {
@@ -32,16 +26,13 @@ struct Fault {
       } catch (...) {
         return ::testing::AssertionFailure() << "run " << n << " ended by an exception not of the library";
       }
-      hits = fault.fired();
+      hits = fired();
     }
     if (::testing::Test::HasFailure())
       return ::testing::AssertionFailure() << "run " << n << ": the scenario's expectations failed";
     if (!error.empty() && hits == 0)
       return ::testing::AssertionFailure() << "run " << n << " threw without the fault: " << error;
-    // A refused allocation is counted as made (Q_New counts every attempt).
-    const int refused = fault.allocations ? hits : 0;
-    RuntimeTest::noteRefused(refused);
-    if (::testing::AssertionResult settled = balance.settles(refused); !settled)
+    if (auto settled = balance.settles(refusedAllocations() - refusedBefore); !settled)
       return ::testing::AssertionFailure() << "run " << n << ": " << settled.message();
     if (hits == 0) return ::testing::AssertionSuccess() << n << " runs";
   }
@@ -51,14 +42,12 @@ struct Fault {
 }  // namespace
 
 ::testing::AssertionResult sweepAllocations(const std::function<void()>& scenario, int maxRuns) {
-  return sweep({[](FaultGuard& g, int n) { g.failAllocation(n); }, [] { return platform::fault::allocationsFailed(); },
-                true},
-               scenario, maxRuns);
+  return sweep([](int n) { failAllocation(n); }, [] { return platform::fault::allocationsFailed(); }, scenario,
+               maxRuns);
 }
 
 ::testing::AssertionResult sweepCall(platform::fault::Call call, int result, const std::function<void()>& scenario,
                                      int maxRuns) {
-  return sweep({[=](FaultGuard& g, int n) { g.arm(call, {.countdown = n, .persist = false, .result = result}); },
-                [=] { return platform::fault::fired(call); }, false},
-               scenario, maxRuns);
+  return sweep([=](int n) { platform::fault::arm(call, {.countdown = n, .persist = false, .result = result}); },
+               [=] { return platform::fault::fired(call); }, scenario, maxRuns);
 }

@@ -2,13 +2,11 @@
 
 #include <thread>
 
-#include "fault.h"
+#include "Q_Memory.h"
 #include "raw_socket.h"
-#include "vardel_platform.h"
 
 bool waitFor(const std::function<bool()>& done, int milliseconds, const Pump& pump) {
-  const auto deadline = Clock::now() + std::chrono::milliseconds(milliseconds);
-  for (;;) {
+  for (const auto deadline = Clock::now() + std::chrono::milliseconds(milliseconds);;) {
     if (pump) pump();
     if (done()) return true;
     if (Clock::now() > deadline) return false;
@@ -16,47 +14,39 @@ bool waitFor(const std::function<bool()>& done, int milliseconds, const Pump& pu
   }
 }
 
-bool staysFalse(const std::function<bool()>& condition, int milliseconds, const Pump& pump) {
-  return !waitFor(condition, milliseconds, pump);
+AllocationBalance::AllocationBalance()
+    : m_iNewBase(Q_Memory::sm_iNewCount.load()), m_iDeleteBase(Q_Memory::sm_iDeleteCount.load()) {}
+
+int AllocationBalance::outstanding() const {
+  // Deletes first: a release is counted after its allocation, so this order
+  // never shows a release without its allocation.
+  const int deletes = Q_Memory::sm_iDeleteCount.load() - m_iDeleteBase;
+  return Q_Memory::sm_iNewCount.load() - m_iNewBase - deletes;
 }
 
-void pumpFor(int milliseconds, const Pump& pump) {
-  waitFor([] { return false; }, milliseconds, pump);
+::testing::AssertionResult AllocationBalance::settles(int target, double seconds) const {
+  waitFor([&] { return outstanding() == target; }, static_cast<int>(seconds * 1000));
+  if (const int left = outstanding() - target; left != 0)
+    return ::testing::AssertionFailure() << left << " library allocation(s) not given back after " << seconds << " s";
+  return ::testing::AssertionSuccess();
 }
-
-double secondsSince(Clock::time_point start) { return std::chrono::duration<double>(Clock::now() - start).count(); }
 
 void RuntimeTest::SetUp() {
   platform::fault::disarmAll();
-  m_iRefusalsSeen = platform::fault::allocationsFailed();
+  m_iRefusedBefore = refusedAllocations();
   platform::setLocalHost("127.0.0.1");
   m_balance = AllocationBalance();
   m_runtime = std::make_unique<N_Initializer>();
   m_loopback = std::make_unique<N_Address>("127.0.0.1");
-  // Its lookup is done before the test arms any fault.
-  waitFor([&] { return m_loopback->fullyResolved(); }, 2000);
+  waitFor([&] { return m_loopback->fullyResolved(); }, 2000);  // before the test arms any fault
   m_iPort = freePort(true);
-  sm_iNotedRefusals = 0;
 }
 
 void RuntimeTest::TearDown() {
-  disarmFaults();
+  platform::fault::disarmAll();
   stopRuntime();
-  if (!m_bCheckBalance) return;
   // Resolver threads that nobody joins may still be giving back their blocks.
-  const int refused = m_iRefused + sm_iNotedRefusals;
-  EXPECT_TRUE(m_balance.settles(refused, 5.0));
-}
-
-void RuntimeTest::failAllocation(int nth, bool persist) {
-  countRefusals();
-  platform::fault::failAllocation(nth, persist);  // starts its count anew
-  m_iRefusalsSeen = 0;
-}
-
-void RuntimeTest::disarmFaults() {
-  countRefusals();
-  platform::fault::disarmAll();  // leaves the count as it is
+  EXPECT_TRUE(m_balance.settles(refusedAllocations() - m_iRefusedBefore, 5.0));
 }
 
 void RuntimeTest::stopRuntime() {
@@ -65,9 +55,3 @@ void RuntimeTest::stopRuntime() {
 }
 
 int RuntimeTest::freePort(bool pairWithNext) { return raw::freePort(pairWithNext); }
-
-void RuntimeTest::countRefusals() {
-  const int now = platform::fault::allocationsFailed();
-  m_iRefused += now - m_iRefusalsSeen;
-  m_iRefusalsSeen = now;
-}
