@@ -51,8 +51,8 @@ RawPeer::RawPeer(bool server, const char* ip, const char* peerIp, std::uint16_t 
     m_dataListener = raw::listenOn(ip, port);
     m_controlListener = raw::listenOn(ip, controlPort);
   } else {
-    m_data = raw::connectFrom(ip, peerIp, port);
-    m_control = raw::connectFrom(ip, peerIp, kControlPort);
+    m_data = raw::connectTo(peerIp, port, ip);
+    m_control = raw::connectTo(peerIp, kControlPort, ip);
     m_bConnected = m_data >= 0 && m_control >= 0;
   }
   m_udp = raw::udpBound(ip, static_cast<std::uint16_t>(port + 1));
