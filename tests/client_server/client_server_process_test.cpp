@@ -65,6 +65,7 @@ class ClientsTest : public ClientServerProcessTest, public ::testing::WithParamI
   std::vector<std::string> peerHeartbeat() const {
     return GetParam() > 20 ? std::vector<std::string>{"--hb-frequency", "1", "--hb-latency", "5"} : kSlowHeartbeat;
   }
+  float allowedLatency() const { return GetParam() > 20 ? 5.0f : 1.0f; }
   void TearDown() override {
     ClientServerProcessTest::TearDown();
     N_Initializer::setMaximumWaitEvents(64);
@@ -123,14 +124,16 @@ TEST_P(ClientsTest, ExchangeAndLeave) {
   for (int i = 0; i < count; ++i) {
     EXPECT_EQ(inOrder, reliable[clients[i]]) << peers[i]->host();
     EXPECT_TRUE(peers[i]->waitLine("e" + std::to_string(kPayloads - 1) + ";", 20000, serve)) << peers[i]->host();
-    // Measured (replies carry no number: one that comes after the next
-    // heartbeat left, from a server slower than the frequency, measures next
-    // to nothing, so only the bound above is checked).
+    // Measured, and within the latency the heartbeat allows (sixty
+    // processes under a sanitizer take more than a second to answer).
+    // Replies carry no number: one that comes after the next heartbeat left,
+    // from a server slower than the frequency, measures next to nothing, so
+    // only the upper bound is checked.
     auto latency = peers[i]->waitLine("latency", 5000, serve);
     ASSERT_TRUE(latency) << peers[i]->host();
-    EXPECT_LT(valueOf(*latency), 1.0);
+    EXPECT_LT(valueOf(*latency), allowedLatency());
     EXPECT_TRUE(waitFor([&] { return clients[i]->getLatency() > 0.0f; }, 5000, serve));
-    EXPECT_LT(clients[i]->getLatency(), 1.0f);
+    EXPECT_LT(clients[i]->getLatency(), allowedLatency());
     datagrams += unreliable[clients[i]];
   }
   // Datagrams may be lost on a loaded machine, but the channel carries them.
