@@ -97,6 +97,7 @@ class VARDEL_API N_Socket {
     bool bConsumed;                      ///< poll() handed it out; the next poll() frees it.
     bool bLive;                          ///< The owning socket is alive.
     bool bMessageEnd;                    ///< A send entry that carries the last byte of its message.
+    bool bDirect;                        ///< A read entry whose read went first into the message in collection.
     N_Socket* pSocket;                   ///< The owning socket; null for an orphan.
   };
 
@@ -266,6 +267,13 @@ class VARDEL_API N_Socket {
   // bool results are false when the socket was destroyed during a receive()
   // call; the caller must not touch it again then.
   void postRead();
+  // Whether the next read may go straight into the block of the message in
+  // collection: its length is known, its block has room for all of it, and
+  // no other read of this socket is under way.
+  bool directReadable();
+  // Counts the `bytes` that a direct read put into the block; false if the
+  // socket was destroyed during a receive() call.
+  bool receiveDirect(DataQueue* read, unsigned int bytes);
   // What the receive path takes from N_Limits, read once per read.
   struct ReadLimits {
     std::uint32_t uMaximumLength;

@@ -19,6 +19,7 @@ inline N_Socket::DataQueue* appendEntry(Q_DLList<N_Socket::DataQueue>* queue, N_
   entry->bConsumed = false;
   entry->bLive = true;
   entry->bMessageEnd = false;
+  entry->bDirect = false;
   entry->pSocket = socket;
   return entry;
 }

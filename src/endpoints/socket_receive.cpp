@@ -37,16 +37,39 @@ constexpr int kPrefixSlack = 1024;
 // read buffer rather than keeping all of it, and the block of a long message
 // starts at this size and doubles as the bytes arrive.
 constexpr unsigned int kCompactBelow = 16384;
+// A message with at least this many bytes still to come is read straight
+// into its block instead of being copied there out of read buffers.
+constexpr std::int64_t kDirectFrom = 4096;
 
 }  // namespace
+
+bool N_Socket::directReadable() {
+  if (!m_bPackage || m_bStreamBroken || m_pPacketBuffer == nullptr) return false;
+  const std::int64_t have = m_iPacketBytesHave;
+  const std::int64_t missing = m_iPacketBytesMissing;
+  if (have < 4 || missing < kDirectFrom || m_iPacketCapacity < have + missing) return false;
+  // Reads of one socket complete in the order they were posted; one still
+  // under way would bring bytes that belong in front of these.
+  Q_DLList<DataQueue>* queue = Runtime::reads();
+  for (DataQueue* entry = queue->getFirst(); entry != nullptr; entry = queue->getNext(entry))
+    if (entry->pSocket == this) return false;
+  return true;
+}
 
 void N_Socket::postRead() {
   Q_DLList<DataQueue>* queue = Runtime::reads();
   DataQueue* entry = nullptr;
+  // A message whose length is known and whose block waits is read straight
+  // into the block, and only what follows it into a read buffer: behind a
+  // long message just the next prefix, so that the next read can go
+  // straight into the next block too.
+  const bool direct = directReadable();
+  const unsigned int spill =
+      direct && m_iPacketBytesHave + std::int64_t{m_iPacketBytesMissing} >= kReadSize ? 4 : kReadSize;
   try {
     entry = appendEntry(queue, this, true, false);
-    entry->wsaBuf.len = kReadSize;
-    entry->pBuffer = Q_NewArray<char>(kReadSize);
+    entry->wsaBuf.len = spill;
+    entry->pBuffer = Q_NewArray<char>(spill);
     entry->wsaBuf.buf = entry->pBuffer;
   } catch (Q_MemoryException*) {
     // Without a read posted no FD_READ would come again: the connection
@@ -60,9 +83,18 @@ void N_Socket::postRead() {
     return;
   }
   entry->overlapped.hEvent = entry;
+  entry->bDirect = direct;
+  platform::WSABUF buffers[2];
+  platform::DWORD count = 0;
+  if (direct) {
+    buffers[count].buf = m_pPacketBuffer + m_iPacketBytesHave;
+    buffers[count].len = static_cast<std::uint32_t>(m_iPacketBytesMissing);
+    ++count;
+  }
+  buffers[count++] = entry->wsaBuf;
   platform::DWORD received = 0;
   platform::DWORD flags = 0;
-  if (WSARecv(m_socket, &entry->wsaBuf, 1, &received, &flags, &entry->overlapped, Runtime::readComplete) ==
+  if (WSARecv(m_socket, buffers, count, &received, &flags, &entry->overlapped, Runtime::readComplete) ==
       platform::SOCKET_ERROR) {
     int error = platform::WSAGetLastError();
     // WSAEWOULDBLOCK counts as under way, like WSA_IO_PENDING.
@@ -234,6 +266,23 @@ struct Collection {
 
 }  // namespace
 
+bool N_Socket::receiveDirect(DataQueue* read, unsigned int bytes) {
+  Collection collected{m_pPacketBuffer, m_iPacketCapacity, m_iPacketBytesHave, m_iPacketBytesMissing};
+  // The bytes are in place already: they only count.
+  collected.have = static_cast<int>(collected.have + bytes);
+  collected.missing = static_cast<int>(collected.missing - bytes);
+  if (collected.missing > 0) return true;
+  DataQueue* message;
+  try {
+    message = appendMessage(collected.block, collected.block + 4, static_cast<unsigned int>(collected.have - 4));
+  } catch (Q_MemoryException*) {
+    breakStream();
+    return true;
+  }
+  collected.release();
+  return deliver(read, message);
+}
+
 bool N_Socket::receivePackaged(DataQueue* read, unsigned int bytes, const ReadLimits& limits) {
   if (m_bStreamBroken) return true;
   Collection collected{m_pPacketBuffer, m_iPacketCapacity, m_iPacketBytesHave, m_iPacketBytesMissing};
@@ -334,14 +383,37 @@ void N_Initializer::receiveComplete(platform::DWORD error, platform::DWORD bytes
   RuntimeLock lock;
   N_Socket* socket = read->pSocket;
   if (read->bLive && socket != nullptr) {
-    unsigned int size = std::min<unsigned int>(bytes, read->wsaBuf.len);
-    socket->m_uBytesReceived += size;
+    // A direct read filled the block of the message in collection first; it
+    // asked for no more than the bytes missing, which nothing changed since.
+    const unsigned int direct =
+        read->bDirect ? std::min<unsigned int>(bytes, static_cast<unsigned int>(socket->m_iPacketBytesMissing)) : 0;
+    unsigned int size = std::min<unsigned int>(bytes - direct, read->wsaBuf.len);
+    socket->m_uBytesReceived += direct + size;
     const N_Limits limits = getLimits();
     const N_Socket::ReadLimits readLimits{limits.uMaximumMessageSize, limits.bCompactMessages};
-    if (socket->m_bPackage)
-      socket->receivePackaged(read, size, readLimits);
-    else
-      socket->receivePlain(read, size, readLimits);
+    if (read->bDirect && !socket->m_bPackage) {
+      // Packaging was switched off while the read was under way: its bytes
+      // make one plain read, as if they had all come into the read buffer.
+      char* joined = nullptr;
+      try {
+        joined = Q_NewArray<char>(std::size_t{direct} + size);
+      } catch (Q_MemoryException*) {
+        socket->breakStream();
+      }
+      if (joined != nullptr) {
+        if (direct > 0) std::memcpy(joined, socket->m_pPacketBuffer + socket->m_iPacketBytesHave, direct);
+        if (size > 0) std::memcpy(joined + direct, read->wsaBuf.buf, size);
+        Q_DeleteArray(read->pBuffer);
+        read->pBuffer = joined;
+        read->wsaBuf.buf = joined;
+        socket->receivePlain(read, direct + size, readLimits);
+      }
+    } else if (direct == 0 || socket->receiveDirect(read, direct)) {
+      if (socket->m_bPackage)
+        socket->receivePackaged(read, size, readLimits);
+      else
+        socket->receivePlain(read, size, readLimits);
+    }
   }
   Q_DeleteArray(read->pBuffer);
   read->pBuffer = nullptr;
