@@ -263,6 +263,20 @@ class VARDEL_API N_Socket {
 
   static bool pollEvent(const N_Socket*& socket, bool connected);
 
+  // Hands a send entry of this socket to Winsock, in the pump's pass `pass`
+  // or, with the network thread's queue of completions, at once from the
+  // sending thread; false when it stays unissued for a later pass.
+  bool issueSend(DataQueue* entry, std::uint64_t pass, void* completionQueue);
+  // A copy of one piece of a message being sent.
+  struct Chunk {
+    char* buffer;
+    unsigned int length;
+  };
+  // Queues the chunks of one message, with the runtime's mutex held, and
+  // issues them when nothing of the socket is queued before them: then true,
+  // and the caller writes them (WSAFlushSends on `socket`).
+  bool sendQueued(const Chunk* chunks, std::size_t count, platform::SOCKET& socket);
+
   // Receive path, on the network thread with the runtime's mutex held. The
   // bool results are false when the socket was destroyed during a receive()
   // call; the caller must not touch it again then.

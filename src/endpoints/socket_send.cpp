@@ -4,6 +4,7 @@
 #include <cstdint>
 #include <cstring>
 #include <new>
+#include <span>
 #include <vector>
 
 #include "N_Initializer.h"
@@ -31,10 +32,6 @@ void N_Socket::send(void* data, unsigned int size) {
   // The copies are made before the lock is taken: a large message then holds
   // up the network thread only for the appends, which is what keeps the
   // entries of one message together and in order.
-  struct Chunk {
-    char* buffer;
-    unsigned int length;
-  };
   std::vector<Chunk> chunks;
   try {
     if (!m_bPackage) {
@@ -65,11 +62,19 @@ void N_Socket::send(void* data, unsigned int size) {
     throw;
   }
 
+  platform::SOCKET socket = 0;
+  // The write itself is made outside the runtime's mutex, so that the
+  // network thread, which the bytes may wake, need not wait for it.
+  if (sendQueued(chunks.data(), chunks.size(), socket)) platform::WSAFlushSends(socket);
+}
+
+bool N_Socket::sendQueued(const Chunk* chunks, std::size_t count, platform::SOCKET& socket) {
   RuntimeLock lock;
+  socket = m_socket;
   DataQueue* first = nullptr;
   std::size_t appended = 0;
   try {
-    for (const Chunk& c : chunks) {
+    for (const Chunk& c : std::span(chunks, count)) {
       DataQueue* entry = Runtime::appendSend(this);
       entry->pBuffer = c.buffer;
       entry->wsaBuf.buf = c.buffer;
@@ -77,19 +82,64 @@ void N_Socket::send(void* data, unsigned int size) {
       if (first == nullptr) first = entry;
       ++appended;
       // Its completion counts the message as sent.
-      entry->bMessageEnd = appended == chunks.size();
+      entry->bMessageEnd = appended == count;
     }
   } catch (...) {
     // Nothing of a message that failed stays queued.
     Runtime::dropSends(first);
-    for (std::size_t i = appended; i < chunks.size(); ++i) Q_DeleteArray(chunks[i].buffer);
+    for (std::size_t i = appended; i < count; ++i) Q_DeleteArray(chunks[i].buffer);
     throw;
   }
   unsigned int queued = 0;
-  for (const Chunk& c : chunks) queued += c.length;
+  for (const Chunk& c : std::span(chunks, count)) queued += c.length;
+  // With nothing of this socket queued before the message, the pump would
+  // issue it next anyway: issued from here it needs no pass of the network
+  // thread, and whatever the kernel takes at once is on its way now. Not
+  // while the caller holds the runtime's mutex itself: until it lets go,
+  // nothing is sent.
+  void* const network = Runtime::networkQueue();
+  const bool direct = m_uQueuedSendMessages == 0 && m_bWritable && network != nullptr &&
+                      platform::MutexHoldCount(Runtime::mutex()) == 1;
   m_uQueuedSendBytes += queued;
-  m_uQueuedSendMessages += static_cast<unsigned int>(chunks.size());
-  Runtime::sendsQueued(first, queued);
+  m_uQueuedSendMessages += static_cast<unsigned int>(count);
+  DataQueue* pumpFrom = first;
+  if (direct) {
+    Q_DLList<DataQueue>* queue = Runtime::sends();
+    const std::uint64_t pass = Runtime::lastPass();
+    while (pumpFrom != nullptr && issueSend(pumpFrom, pass, network)) pumpFrom = queue->getNext(pumpFrom);
+  }
+  Runtime::sendsQueued(pumpFrom, queued);
+  return direct;
+}
+
+bool N_Socket::issueSend(DataQueue* entry, std::uint64_t pass, void* completionQueue) {
+  entry->overlapped.hEvent = entry;
+  platform::DWORD sent = 0;
+  const int result =
+      completionQueue != nullptr
+          ? platform::WSASendFor(completionQueue, m_socket, &entry->wsaBuf, 1, &sent, 0, &entry->overlapped,
+                                 sendComplete)
+          : platform::WSASend(m_socket, &entry->wsaBuf, 1, &sent, 0, &entry->overlapped, sendComplete);
+  if (result == 0) {
+    entry->bIssued = true;
+    return true;
+  }
+  int error = platform::WSAGetLastError();
+  if (error == platform::WSAEWOULDBLOCK) {
+    // This and every later entry of the socket wait for FD_WRITE.
+    m_bWritable = false;
+    entry->overlapped.hEvent = nullptr;
+  } else if (error == platform::WSA_IO_PENDING) {
+    // Later entries wait for this one's completion.
+    entry->bIssued = true;
+    m_bWritable = false;
+    m_bWriteCompletionPending = true;
+  } else {
+    // Tried again on a later pass. The socket's later entries must not
+    // overtake it, so they wait too.
+    m_uPumpHeldPass = pass;
+  }
+  return false;
 }
 
 void N_Socket::sendComplete(platform::DWORD dwError, platform::DWORD cbTransferred, platform::OVERLAPPED* lpOverlapped,

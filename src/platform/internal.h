@@ -263,7 +263,7 @@ class WaitSet {
 // of finished operations, an eventfd that other threads write to wake its
 // wait, and the wait's registrations. Completion routines run only from the
 // owner's alertable waits.
-class Reactor {
+class Reactor : public std::enable_shared_from_this<Reactor> {
  public:
   Reactor();
   ~Reactor();
@@ -290,13 +290,26 @@ class Reactor {
   // Sockets on which this thread has operations under way (owner only).
   std::vector<IoSocket> ioSockets;
   void watch(const std::shared_ptr<SocketState>& socket);
+  // Any thread: a socket with operations of the owner that another thread
+  // issued and that still wait for the kernel; the owner's next alertable
+  // wait takes it among its own.
+  void adopt(const std::shared_ptr<SocketState>& socket);
+  // Owner only: takes what adopt() handed over.
+  void takeAdopted();
+  // Owner only: between these the owner may block in an alertable wait, and
+  // a completion posted by another thread must knock.
+  void beginSleep() { sleepy_.store(true); }
+  void endSleep() { sleepy_.store(false, std::memory_order_relaxed); }
   WaitSet waits{*this};
 
  private:
   std::atomic<int> wakeFd_{-1};
   std::mutex lock_;
   std::vector<Completion> queue_;
+  std::vector<std::shared_ptr<SocketState>> adopted_;
   std::atomic<bool> pending_{false};
+  std::atomic<bool> adoptedPending_{false};
+  std::atomic<bool> sleepy_{false};
 };
 
 // ---- Events ---------------------------------------------------------------

@@ -141,6 +141,12 @@ BOOL ReleaseMutex(HANDLE hMutex) {
   return 1;
 }
 
+DWORD MutexHoldCount(HANDLE hMutex) {
+  std::shared_ptr<detail::MutexHandle> handle = detail::mutexTable().find(detail::handleValue(hMutex));
+  if (!handle || !handle->object->ownedByCaller()) return 0;
+  return static_cast<DWORD>(handle->object->depth);
+}
+
 BOOL CloseHandle(HANDLE hObject) {
   std::uint64_t value = detail::handleValue(hObject);
   if ((value >> 56) == static_cast<std::uint64_t>(detail::HandleKind::Event)) return WSACloseEvent(hObject);

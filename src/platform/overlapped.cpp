@@ -7,6 +7,7 @@
 
 #include <cerrno>
 #include <algorithm>
+#include <new>
 
 namespace platform {
 namespace detail {
@@ -153,7 +154,7 @@ ssize_t readInto(SocketState& socket, Operation& op) {
 }
 
 Operation* makeOperation(bool isSend, WSABUF* buffers, DWORD count, WSAOVERLAPPED* overlapped,
-                         LPWSAOVERLAPPED_COMPLETION_ROUTINE routine) {
+                         LPWSAOVERLAPPED_COMPLETION_ROUTINE routine, std::shared_ptr<Reactor> owner = nullptr) {
   auto* op = new Operation{};
   op->isSend = isSend;
   op->count = count;
@@ -164,7 +165,7 @@ Operation* makeOperation(bool isSend, WSABUF* buffers, DWORD count, WSAOVERLAPPE
   }
   op->overlapped = overlapped;
   op->routine = routine;
-  op->owner = Reactor::current();
+  op->owner = owner ? std::move(owner) : Reactor::current();
   return op;
 }
 
@@ -216,8 +217,13 @@ void abortOperations(SocketState& socket, DWORD error) {
 
 }  // namespace detail
 
-int WSASend(SOCKET s, WSABUF* lpBuffers, DWORD dwBufferCount, DWORD* lpNumberOfBytesSent, DWORD,
-            WSAOVERLAPPED* lpOverlapped, LPWSAOVERLAPPED_COMPLETION_ROUTINE lpCompletionRoutine) {
+namespace {
+
+// WSASend, with its completion for `owner` (null: the calling thread). Sent
+// for another thread, the write waits for WSAFlushSends.
+int sendFor(const std::shared_ptr<detail::Reactor>& owner, SOCKET s, WSABUF* lpBuffers, DWORD dwBufferCount,
+            DWORD* lpNumberOfBytesSent, WSAOVERLAPPED* lpOverlapped,
+            LPWSAOVERLAPPED_COMPLETION_ROUTINE lpCompletionRoutine) {
   int result = 0;
   bool forcePending = false;
   bool faulted = fault::check(fault::Call::WSASend, result);
@@ -236,23 +242,66 @@ int WSASend(SOCKET s, WSABUF* lpBuffers, DWORD dwBufferCount, DWORD* lpNumberOfB
   }
   if (lpBuffers == nullptr || dwBufferCount == 0 || dwBufferCount > 8) return detail::fail(WSAEINVAL);
   if (lpOverlapped == nullptr || lpCompletionRoutine == nullptr) return detail::fail(WSAEINVAL);
-  // Completions come back through this thread's reactor.
-  if (!detail::Reactor::current()->ready()) return SOCKET_ERROR;
-  detail::SocketGuard hold(*socket);
-  if (socket->closed) return detail::fail(WSAENOTSOCK);
-  if (socket->type == wsa::sockStream) {
-    if (socket->phase == detail::Phase::Connecting) detail::refresh(*socket);
-    if (socket->phase != detail::Phase::Connected) return detail::fail(WSAENOTCONN);
-    if (socket->shutWrite) return detail::fail(WSAESHUTDOWN);
-    if (socket->streamError != 0) return detail::failFromErrno(socket->streamError);
+  // Completions come back through the owner's reactor.
+  detail::Reactor& reactor = owner ? *owner : *detail::Reactor::current();
+  if (!reactor.ready()) return SOCKET_ERROR;
+  {
+    detail::SocketGuard hold(*socket);
+    if (socket->closed) return detail::fail(WSAENOTSOCK);
+    if (socket->type == wsa::sockStream) {
+      if (socket->phase == detail::Phase::Connecting) detail::refresh(*socket);
+      if (socket->phase != detail::Phase::Connected) return detail::fail(WSAENOTCONN);
+      if (socket->shutWrite) return detail::fail(WSAESHUTDOWN);
+      if (socket->streamError != 0) return detail::failFromErrno(socket->streamError);
+    }
+    detail::Operation* op =
+        detail::makeOperation(true, lpBuffers, dwBufferCount, lpOverlapped, lpCompletionRoutine, owner);
+    socket->sends.push_back(op);
+    socket->unflushed += op->total;
+    if (!owner) reactor.watch(socket);
+    if (forcePending || socket->unflushed > detail::kDeferLimit) return detail::fail(WSA_IO_PENDING);
+    if (lpNumberOfBytesSent != nullptr) *lpNumberOfBytesSent = static_cast<DWORD>(op->total);
   }
-  detail::Operation* op = detail::makeOperation(true, lpBuffers, dwBufferCount, lpOverlapped, lpCompletionRoutine);
-  socket->sends.push_back(op);
-  socket->unflushed += op->total;
-  detail::Reactor::current()->watch(socket);
-  if (forcePending || socket->unflushed > detail::kDeferLimit) return detail::fail(WSA_IO_PENDING);
-  if (lpNumberOfBytesSent != nullptr) *lpNumberOfBytesSent = static_cast<DWORD>(op->total);
   return 0;
+}
+
+}  // namespace
+
+int WSASend(SOCKET s, WSABUF* lpBuffers, DWORD dwBufferCount, DWORD* lpNumberOfBytesSent, DWORD,
+            WSAOVERLAPPED* lpOverlapped, LPWSAOVERLAPPED_COMPLETION_ROUTINE lpCompletionRoutine) {
+  return sendFor(nullptr, s, lpBuffers, dwBufferCount, lpNumberOfBytesSent, lpOverlapped, lpCompletionRoutine);
+}
+
+void* WSAGetCompletionQueue() {
+  try {
+    return new std::shared_ptr<detail::Reactor>(detail::Reactor::current());
+  } catch (const std::bad_alloc&) {
+    return nullptr;
+  }
+}
+
+void WSAFlushSends(SOCKET s) {
+  std::shared_ptr<detail::SocketState> socket = detail::findSocket(s);
+  if (!socket) return;
+  std::shared_ptr<detail::Reactor> owner;
+  {
+    detail::SocketGuard hold(*socket);
+    if (socket->closed || socket->sends.empty()) return;
+    if (!socket->sendBlocked) detail::progressSends(*socket);
+    // What is left goes on in the waits of the thread that its completions
+    // belong to (the library's sends have one).
+    if (!socket->sends.empty()) owner = socket->sends.front()->owner;
+  }
+  if (owner) owner->adopt(socket);
+}
+
+void WSACloseCompletionQueue(void* queue) { delete static_cast<std::shared_ptr<detail::Reactor>*>(queue); }
+
+int WSASendFor(void* queue, SOCKET s, WSABUF* lpBuffers, DWORD dwBufferCount, DWORD* lpNumberOfBytesSent, DWORD,
+               WSAOVERLAPPED* lpOverlapped, LPWSAOVERLAPPED_COMPLETION_ROUTINE lpCompletionRoutine) {
+  if (queue == nullptr) return detail::fail(WSAEINVAL);
+  return sendFor(*static_cast<std::shared_ptr<detail::Reactor>*>(queue), s, lpBuffers, dwBufferCount,
+                 lpNumberOfBytesSent, lpOverlapped, lpCompletionRoutine);
 }
 
 int WSARecv(SOCKET s, WSABUF* lpBuffers, DWORD dwBufferCount, DWORD* lpNumberOfBytesRecvd, DWORD* lpFlags,

@@ -49,14 +49,39 @@ void Reactor::post(const Completion& completion) {
   {
     std::lock_guard<std::mutex> hold(lock_);
     queue_.push_back(completion);
-    pending_.store(true, std::memory_order_release);
   }
-  // The owner finds its own completions before it sleeps; only other threads
-  // need to knock.
-  if (t_self != this) wake();
+  pending_.store(true);
+  // The owner finds its completions before it sleeps (it looks after
+  // beginSleep()); only other threads need to knock, and only while it may
+  // sleep.
+  if (t_self != this && sleepy_.load()) wake();
 }
 
-bool Reactor::hasCompletions() { return pending_.load(std::memory_order_acquire); }
+bool Reactor::hasCompletions() { return pending_.load(); }
+
+void Reactor::adopt(const std::shared_ptr<SocketState>& socket) {
+  if (t_self == this) {
+    watch(socket);
+    return;
+  }
+  {
+    std::lock_guard<std::mutex> hold(lock_);
+    adopted_.push_back(socket);
+  }
+  adoptedPending_.store(true);
+  wake();
+}
+
+void Reactor::takeAdopted() {
+  if (!adoptedPending_.load()) return;
+  std::vector<std::shared_ptr<SocketState>> taken;
+  {
+    std::lock_guard<std::mutex> hold(lock_);
+    taken.swap(adopted_);
+    adoptedPending_.store(false);
+  }
+  for (const std::shared_ptr<SocketState>& socket : taken) watch(socket);
+}
 
 bool Reactor::runCompletions() {
   if (!pending_.load(std::memory_order_acquire)) return false;
@@ -64,7 +89,7 @@ bool Reactor::runCompletions() {
   {
     std::lock_guard<std::mutex> hold(lock_);
     batch.swap(queue_);
-    pending_.store(false, std::memory_order_relaxed);
+    pending_.store(false);
   }
   // Routines may issue new operations, whose completions queue up for the
   // next alertable wait rather than running here.

@@ -452,6 +452,7 @@ DWORD waitForEvents(DWORD count, const WSAEVENT* handles, DWORD milliseconds, bo
   const Clock::time_point deadline = Clock::now() + std::chrono::milliseconds(infinite ? 0 : milliseconds);
   for (;;) {
     if (alertable) {
+      self.takeAdopted();
       set.flush(self.ioSockets);
       if (self.runCompletions()) return WSA_WAIT_IO_COMPLETION;
     }
@@ -462,10 +463,13 @@ DWORD waitForEvents(DWORD count, const WSAEVENT* handles, DWORD milliseconds, bo
       index = static_cast<DWORD>(signalled);
       return WSA_WAIT_EVENT_0;
     }
-    // Completions posted by other threads after the look above have written
+    // Completions posted by other threads after the look below have written
     // the wake descriptor, so this wait returns at once.
+    if (alertable) self.beginSleep();
     const int timeout = (alertable && self.hasCompletions()) ? 0 : remainingMilliseconds(infinite, deadline);
-    if (!set.sleep(timeout)) {
+    const bool slept = set.sleep(timeout);
+    self.endSleep();
+    if (!slept) {
       if (errno == EINTR) continue;
       fail(wsaErrorFromErrno(errno));
       return WSA_WAIT_FAILED;

@@ -30,6 +30,9 @@ struct SECURITY_ATTRIBUTES;
 HANDLE CreateMutexA(SECURITY_ATTRIBUTES* lpMutexAttributes, BOOL bInitialOwner, const char* lpName);
 DWORD WaitForSingleObject(HANDLE hHandle, DWORD dwMilliseconds);
 BOOL ReleaseMutex(HANDLE hMutex);
+// Not Win32: how many times the calling thread holds the mutex now (0: it
+// doesn't own it, or the handle names no mutex).
+DWORD MutexHoldCount(HANDLE hMutex);
 BOOL CloseHandle(HANDLE hObject);
 
 void Sleep(DWORD dwMilliseconds);

@@ -21,6 +21,7 @@
 //    WSA_IO_PENDING. The bytes go to the kernel at the issuing thread's next
 //    alertable wait, in one gathered write per socket. A thread that issues
 //    sends must therefore wait alertably, as the network thread does.
+//    WSASendFor with WSAFlushSends (below) writes on the calling thread.
 //  - WSARecv reads at once when data waits (answer 0), else it stays pending.
 //    A zero-byte completion on a stream is the peer's orderly close.
 //  - closesocket hands sends already accepted to the kernel if it can without
@@ -221,6 +222,19 @@ int WSAEnumNetworkEvents(SOCKET s, WSAEVENT hEventObject, WSANETWORKEVENTS* lpNe
 int WSASend(SOCKET s, WSABUF* lpBuffers, DWORD dwBufferCount, DWORD* lpNumberOfBytesSent,
             DWORD dwFlags, WSAOVERLAPPED* lpOverlapped,
             LPWSAOVERLAPPED_COMPLETION_ROUTINE lpCompletionRoutine);
+// Not Winsock: sends for another thread. WSAGetCompletionQueue names the
+// calling thread's queue of completions (null when memory runs out), until
+// WSACloseCompletionQueue. WSASendFor is WSASend whose completion routine
+// runs in an alertable wait of that queue's thread instead of the caller's,
+// and whose bytes wait for WSAFlushSends: it writes, on the calling thread,
+// what the kernel takes of the socket's sends at once, and hands the rest to
+// the thread of the first one's completion, whose alertable waits carry on
+// with it.
+void* WSAGetCompletionQueue();
+void WSACloseCompletionQueue(void* queue);
+int WSASendFor(void* queue, SOCKET s, WSABUF* lpBuffers, DWORD dwBufferCount, DWORD* lpNumberOfBytesSent,
+               DWORD dwFlags, WSAOVERLAPPED* lpOverlapped, LPWSAOVERLAPPED_COMPLETION_ROUTINE lpCompletionRoutine);
+void WSAFlushSends(SOCKET s);
 int WSARecv(SOCKET s, WSABUF* lpBuffers, DWORD dwBufferCount, DWORD* lpNumberOfBytesRecvd,
             DWORD* lpFlags, WSAOVERLAPPED* lpOverlapped,
             LPWSAOVERLAPPED_COMPLETION_ROUTINE lpCompletionRoutine);

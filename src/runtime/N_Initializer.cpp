@@ -224,6 +224,8 @@ void N_Initializer::stop() {
     // mutex; taking it once makes sure that release is done before anything
     // below closes the mutex.
     RuntimeLock once;
+    platform::WSACloseCompletionQueue(Runtime::networkQueue());
+    Runtime::networkQueue() = nullptr;
   }
 
   Q_DeleteArray(reinterpret_cast<char*>(m_installedProtocols));
@@ -294,6 +296,8 @@ unsigned int N_Initializer::threadNetwork(void*) {
   // A copy of the handle: the stop clears m_hMutex after this thread has
   // ended, and the last release comes after THREAD_STOPPED is written.
   MutexHold hold(m_hMutex);
+  // Sends issued on other threads complete in this thread's waits.
+  Runtime::networkQueue() = platform::WSAGetCompletionQueue();
   m_threadState.store(THREAD_RUNNING);
 
   platform::WSAEVENT* const events = m_pWaitEvents;

@@ -33,6 +33,7 @@ class Runtime {
   static Q_DLList<N_Address*>* addresses() { return N_Initializer::m_pAddresses; }
   static Q_DLList<N_Socket::ConnectData>* connects() { return N_Initializer::m_pConnectQueue; }
   static Q_DLList<N_Socket::DataQueue>* reads() { return N_Initializer::m_pInProcessQueue; }
+  static Q_DLList<N_Socket::DataQueue>* sends() { return N_Initializer::m_pOutProcessQueue; }
   // The completion routine of every read the library posts.
   static constexpr auto readComplete = &N_Initializer::receiveComplete;
 
@@ -63,8 +64,14 @@ class Runtime {
   // Takes `first` and every entry behind it out, freeing their buffers: a
   // message that could not be queued whole leaves nothing.
   static void dropSends(N_Socket::DataQueue* first);
-  // The entries from `first` on, `bytes` in all, are ready for the pump.
-  static void sendsQueued(N_Socket::DataQueue* first, unsigned bytes);
+  // The entries from `first` on, `bytes` in all, are queued; from `pumpFrom`
+  // on (null: none) they wait for the pump, which is woken for them.
+  static void sendsQueued(N_Socket::DataQueue* pumpFrom, unsigned bytes);
+  // The network thread's queue of completions, for sends issued on other
+  // threads (WSASendFor); null while that thread doesn't run.
+  static void*& networkQueue();
+  // The number of the last pass (see N_Initializer::pumpSends).
+  static std::uint64_t lastPass() { return N_Initializer::m_uNetworkPasses; }
   // A completed entry leaves the queue (its buffer already freed).
   static void sendDone(N_Socket::DataQueue* entry);
   // The entries in flight of a socket that goes become orphans: Winsock may

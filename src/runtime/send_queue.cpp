@@ -31,10 +31,16 @@ void Runtime::dropSends(N_Socket::DataQueue* first) {
   }
 }
 
-void Runtime::sendsQueued(N_Socket::DataQueue* first, unsigned bytes) {
+void Runtime::sendsQueued(N_Socket::DataQueue* pumpFrom, unsigned bytes) {
   N_Initializer::m_uBytesWaitingForSend += bytes;
-  if (N_Initializer::m_pPumpFrom == nullptr) N_Initializer::m_pPumpFrom = first;
+  if (pumpFrom == nullptr) return;  // issued already: their completions come without a pass
+  if (N_Initializer::m_pPumpFrom == nullptr) N_Initializer::m_pPumpFrom = pumpFrom;
   wake();
+}
+
+void*& Runtime::networkQueue() {
+  static void* queue = nullptr;
+  return queue;
 }
 
 void Runtime::sendDone(N_Socket::DataQueue* entry) {
@@ -84,27 +90,7 @@ void N_Initializer::pumpSends() {
         entry = nullptr;
       }
     } else if (!entry->bIssued && socket->m_bWritable && socket->m_uPumpHeldPass != pass) {
-      entry->overlapped.hEvent = entry;
-      platform::DWORD sent = 0;
-      if (WSASend(socket->m_socket, &entry->wsaBuf, 1, &sent, 0, &entry->overlapped, N_Socket::sendComplete) == 0) {
-        entry->bIssued = true;
-      } else {
-        int error = platform::WSAGetLastError();
-        if (error == platform::WSAEWOULDBLOCK) {
-          // This and every later entry of the socket wait for FD_WRITE.
-          socket->m_bWritable = false;
-          entry->overlapped.hEvent = nullptr;
-        } else if (error == platform::WSA_IO_PENDING) {
-          // Later entries wait for this one's completion.
-          entry->bIssued = true;
-          socket->m_bWritable = false;
-          socket->m_bWriteCompletionPending = true;
-        } else {
-          // Tried again on a later pass. The socket's later entries must not
-          // overtake it, so they wait too.
-          socket->m_uPumpHeldPass = pass;
-        }
-      }
+      socket->issueSend(entry, pass, nullptr);
     }
     if (entry != nullptr && firstUnsettled == nullptr && (!entry->bIssued || entry->pSocket == nullptr))
       firstUnsettled = entry;
