@@ -218,4 +218,20 @@ std::uint16_t freePort() {
   return 0;
 }
 
+int silentPeer(std::uint16_t port) {
+  int fd = ::socket(AF_INET, SOCK_STREAM, 0);
+  int on = 1;
+  ::setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &on, sizeof on);
+  sockaddr_in a = loopback(port);
+  if (::bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof a) != 0 || ::listen(fd, 4) != 0) {
+    ::close(fd);
+    return -1;
+  }
+  return fd;
+}
+
+void closeSilentPeer(int fd) {
+  if (fd >= 0) ::close(fd);
+}
+
 }  // namespace bench

@@ -37,4 +37,9 @@ Latency plainRoundTrip(std::size_t size, int rounds);
 
 std::uint16_t freePort();
 
+// A listening socket on the loopback `port` that never accepts nor reads:
+// connections to it complete and then fill up. -1 if it can't listen.
+int silentPeer(std::uint16_t port);
+void closeSilentPeer(int fd);
+
 }  // namespace bench

@@ -4,6 +4,7 @@
 //
 //   vardel_bench [--quick] [--rounds N] [--json FILE]
 //   vardel_bench --scaling [--seconds S] [--sizes 20,50,100,200] [--json FILE]
+//   vardel_bench --size BYTES | --round-trip | --memory   (the library alone)
 //
 // Throughput is one-way, every message checked (size, content, order) at the
 // receiver. The round trip is a 32-byte message echoed by the peer. Each
@@ -12,15 +13,23 @@
 // transport runs once, in an order that rotates from round to round, so that
 // a slow spell of the machine falls on all of them alike.
 //
+// After the table and the client and server figures come the library's heap
+// bytes per idle connection end and per message queued behind a peer that
+// doesn't read. --size, --round-trip and --memory measure one figure of the
+// library alone, for profiling.
+//
 // --scaling measures instead a server with many client processes at each
 // size (bench_scaling.cpp), and the platform layer's wait beside 64 to 4096
 // handles (bench_wait.cpp); bench/plot_scaling.py draws its JSON.
+#include <malloc.h>
+
 #include <atomic>
 #include <chrono>
 #include <condition_variable>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <memory>
 #include <mutex>
 #include <string>
 #include <vector>
@@ -79,9 +88,12 @@ class ReplySocket : public N_Socket {
   std::vector<std::uint8_t> reply;
   bool ready = false;
   bool receive(void* data, unsigned int size) override {
-    std::lock_guard<std::mutex> hold(lock);
-    reply.assign(static_cast<std::uint8_t*>(data), static_cast<std::uint8_t*>(data) + size);
-    ready = true;
+    {
+      std::lock_guard<std::mutex> hold(lock);
+      reply.assign(static_cast<std::uint8_t*>(data), static_cast<std::uint8_t*>(data) + size);
+      ready = true;
+    }
+    // Outside the lock: the woken thread must not wait for it at once.
     arrived.notify_one();
     return false;
   }
@@ -166,6 +178,54 @@ bench::Latency libraryRoundTrip(std::size_t size, int rounds) {
   return bench::summarize(micros);
 }
 
+// Heap in use, all arenas (the library allocates on several threads).
+std::size_t heapInUse() {
+  struct mallinfo2 info = mallinfo2();
+  return info.uordblks + info.hblkhd;
+}
+
+// Heap bytes per idle connection end (beside the N_Socket object itself) and
+// per message queued by a sender whose peer doesn't read.
+void libraryMemory() {
+  constexpr int kPairs = 20;  // 40 ends: within the default wait set of 64
+  constexpr int kMessages = 20000;
+  int port = bench::freePort();
+  N_Listener listener(port);
+  N_Address address("127.0.0.1");
+  std::vector<std::unique_ptr<N_Socket>> ends;
+  for (int i = 0; i < 2 * kPairs; ++i) ends.push_back(std::make_unique<N_Socket>());
+  platform::Sleep(50);
+  const std::size_t before = heapInUse();
+  for (int i = 0; i < kPairs; ++i)
+    if (!connectPair(listener, address, port, *ends[2 * i], *ends[2 * i + 1])) {
+      std::printf("\nHeap: no connection (pair %d)\n", i);
+      return;
+    }
+  platform::Sleep(200);
+  const std::size_t connected = heapInUse();
+  std::printf("\nHeap: %.0f bytes per idle connection end", double(connected - before) / (2 * kPairs));
+  // A peer that accepts and never reads: the sender's queue holds what the
+  // kernel's buffers don't.
+  port = bench::freePort();
+  const int peer = bench::silentPeer(static_cast<std::uint16_t>(port));
+  N_Socket out;
+  out.construct(&address, port, N_Socket::SOCKET_TCP);
+  for (auto deadline = Clock::now() + std::chrono::seconds(5); !out.isConnected() && Clock::now() < deadline;)
+    platform::Sleep(1);
+  std::vector<std::uint8_t> message;
+  bench::fillMessage(message, 64, 0);
+  platform::Sleep(50);
+  const std::size_t idle = heapInUse();
+  for (int i = 0; i < kMessages; ++i) out.send(message.data(), 64);
+  platform::Sleep(200);
+  const unsigned queued = out.getQueuedSendMessages();
+  if (queued > 0)
+    std::printf(", %.0f bytes per queued 64 B message (%u queued)", double(heapInUse() - idle) / queued, queued);
+  std::printf("\n");
+  out.destruct();
+  bench::closeSilentPeer(peer);
+}
+
 struct Transport {
   std::string name;
   bench::Throughput (*throughput)(std::size_t size, std::size_t count);
@@ -244,9 +304,15 @@ int main(int argc, char** argv) {
   int rounds = 0;
   std::string json;
   std::size_t only = 0;  // --size N: one throughput case of the library alone, for profiling
+  bool roundTripOnly = false;  // --round-trip: the library's round trip alone, for profiling
+  bool memoryOnly = false;     // --memory: the library's heap figures alone
   for (int i = 1; i < argc; ++i) {
     if (std::strcmp(argv[i], "--quick") == 0) {
       quick = true;
+    } else if (std::strcmp(argv[i], "--round-trip") == 0) {
+      roundTripOnly = true;
+    } else if (std::strcmp(argv[i], "--memory") == 0) {
+      memoryOnly = true;
     } else if (std::strcmp(argv[i], "--size") == 0 && i + 1 < argc) {
       only = std::strtoul(argv[++i], nullptr, 10);
     } else if (std::strcmp(argv[i], "--rounds") == 0 && i + 1 < argc) {
@@ -255,7 +321,7 @@ int main(int argc, char** argv) {
       json = argv[++i];
     } else {
       std::fprintf(stderr,
-                   "usage: %s [--quick] [--rounds N] [--json FILE] | --size BYTES\n"
+                   "usage: %s [--quick] [--rounds N] [--json FILE] | --size BYTES | --round-trip | --memory\n"
                    "       %s --scaling [--seconds S] [--sizes N,N,...] [--json FILE]\n",
                    argv[0], argv[0]);
       return 2;
@@ -266,6 +332,15 @@ int main(int argc, char** argv) {
     bench::Throughput lib = libraryThroughput(only, (64u << 20) / (only + 64));
     std::printf("%zu bytes: %.0f msg/s, %.1f MB/s%s\n", only, lib.messagesPerSecond, lib.megabytesPerSecond,
                 lib.verified ? "" : " (VERIFY FAILED)");
+    return 0;
+  }
+  if (memoryOnly) {
+    libraryMemory();
+    return 0;
+  }
+  if (roundTripOnly) {
+    bench::Latency lib = libraryRoundTrip(32, 20000);
+    std::printf("32 bytes: round trip median %.1f us, p99 %.1f us\n", lib.medianMicros, lib.p99Micros);
     return 0;
   }
   if (rounds <= 0) rounds = quick ? 3 : 7;
@@ -328,6 +403,7 @@ int main(int argc, char** argv) {
   printTable(report);
 
   ClientServerFigures clientServer = benchClientServer(quick);
+  libraryMemory();
   if (!json.empty()) {
     if (!bench::writeJson(report, clientServer, json)) {
       std::fprintf(stderr, "could not write %s\n", json.c_str());
