@@ -263,10 +263,12 @@ class VARDEL_API N_Socket {
 
   static bool pollEvent(const N_Socket*& socket, bool connected);
 
-  // Hands a send entry of this socket to Winsock, in the pump's pass `pass`
-  // or, with the network thread's queue of completions, at once from the
-  // sending thread; false when it stays unissued for a later pass.
-  bool issueSend(DataQueue* entry, std::uint64_t pass, void* completionQueue);
+  // Hands `count` send entries of this socket, from `entry` on, to Winsock in
+  // one WSASend (the first one's overlapped names them all), in the pump's
+  // pass `pass` or, with the network thread's queue of completions, at once
+  // from the sending thread; false when they stay unissued for a later pass.
+  static constexpr unsigned kJoinedSends = 8;
+  bool issueSend(DataQueue* entry, unsigned count, std::uint64_t pass, void* completionQueue);
   // A copy of one piece of a message being sent.
   struct Chunk {
     char* buffer;

@@ -106,22 +106,31 @@ bool N_Socket::sendQueued(const Chunk* chunks, std::size_t count, platform::SOCK
   if (direct) {
     Q_DLList<DataQueue>* queue = Runtime::sends();
     const std::uint64_t pass = Runtime::lastPass();
-    while (pumpFrom != nullptr && issueSend(pumpFrom, pass, network)) pumpFrom = queue->getNext(pumpFrom);
+    while (pumpFrom != nullptr && issueSend(pumpFrom, 1, pass, network)) pumpFrom = queue->getNext(pumpFrom);
   }
   Runtime::sendsQueued(pumpFrom, queued);
   return direct;
 }
 
-bool N_Socket::issueSend(DataQueue* entry, std::uint64_t pass, void* completionQueue) {
+bool N_Socket::issueSend(DataQueue* entry, unsigned count, std::uint64_t pass, void* completionQueue) {
+  Q_DLList<DataQueue>* queue = Runtime::sends();
+  platform::WSABUF buffers[kJoinedSends];
+  DataQueue* joined = entry;
+  for (unsigned i = 0; i < count; ++i, joined = queue->getNext(joined)) buffers[i] = joined->wsaBuf;
+  const auto markIssued = [&] {
+    DataQueue* e = entry;
+    for (unsigned i = 0; i < count; ++i, e = queue->getNext(e)) e->bIssued = true;
+  };
   entry->overlapped.hEvent = entry;
+  entry->overlapped.Offset = count;
   platform::DWORD sent = 0;
   const int result =
       completionQueue != nullptr
-          ? platform::WSASendFor(completionQueue, m_socket, &entry->wsaBuf, 1, &sent, 0, &entry->overlapped,
+          ? platform::WSASendFor(completionQueue, m_socket, buffers, count, &sent, 0, &entry->overlapped,
                                  sendComplete)
-          : platform::WSASend(m_socket, &entry->wsaBuf, 1, &sent, 0, &entry->overlapped, sendComplete);
+          : platform::WSASend(m_socket, buffers, count, &sent, 0, &entry->overlapped, sendComplete);
   if (result == 0) {
-    entry->bIssued = true;
+    markIssued();
     return true;
   }
   int error = platform::WSAGetLastError();
@@ -131,7 +140,7 @@ bool N_Socket::issueSend(DataQueue* entry, std::uint64_t pass, void* completionQ
     entry->overlapped.hEvent = nullptr;
   } else if (error == platform::WSA_IO_PENDING) {
     // Later entries wait for this one's completion.
-    entry->bIssued = true;
+    markIssued();
     m_bWritable = false;
     m_bWriteCompletionPending = true;
   } else {
@@ -145,34 +154,44 @@ bool N_Socket::issueSend(DataQueue* entry, std::uint64_t pass, void* completionQ
 void N_Socket::sendComplete(platform::DWORD dwError, platform::DWORD cbTransferred, platform::OVERLAPPED* lpOverlapped,
                             platform::DWORD dwFlags) {
   DataQueue* entry = static_cast<DataQueue*>(lpOverlapped->hEvent);
+  // The entries that went in the same WSASend follow it in the queue: only
+  // their completion takes them out.
+  const unsigned count = lpOverlapped->Offset > 1 ? lpOverlapped->Offset : 1;
   if (dwError != 0) {
-    const char* text = Q_STR(
-        "sendComplete: dwError = %s (%d),\n              lpOverlapped->hEvent = 0x%08X\n"
-        "              cbTransferred = %d\n              dwFlags = %d\n",
-        getWSErrorName(static_cast<int>(dwError)), static_cast<int>(dwError),
-        static_cast<unsigned int>(reinterpret_cast<std::uintptr_t>(lpOverlapped->hEvent)),
-        static_cast<int>(cbTransferred), static_cast<int>(dwFlags));
-    Sys->verbose("%s", text);
-    // The entry stays queued and isn't sent again. Marking it lets the pump
-    // free it once its socket has died; this runs on the network thread, as
-    // the pump does, so nothing else sees the flag change.
-    entry->bComplete = true;
+    // The entries stay queued and aren't sent again. Marking them lets the
+    // pump free them once their socket has died. One line for each, as for
+    // entries sent on their own (the bytes that went count for the first).
+    RuntimeLock lock;
+    for (unsigned i = 0; i < count && entry != nullptr; ++i, entry = Runtime::sends()->getNext(entry)) {
+      const char* text = Q_STR(
+          "sendComplete: dwError = %s (%d),\n              lpOverlapped->hEvent = 0x%08X\n"
+          "              cbTransferred = %d\n              dwFlags = %d\n",
+          getWSErrorName(static_cast<int>(dwError)), static_cast<int>(dwError),
+          static_cast<unsigned int>(reinterpret_cast<std::uintptr_t>(entry)),
+          static_cast<int>(i == 0 ? cbTransferred : 0), static_cast<int>(dwFlags));
+      Sys->verbose("%s", text);
+      entry->bComplete = true;
+    }
     return;
   }
   RuntimeLock lock;
-  Q_DeleteArray(entry->pBuffer);
-  entry->pBuffer = nullptr;
-  entry->wsaBuf.buf = nullptr;
-  N_Socket* socket = entry->pSocket;
-  if (socket != nullptr && !socket->m_bWritable && socket->m_bWriteCompletionPending) {
-    socket->m_bWritable = true;
-    socket->m_bWriteCompletionPending = false;
+  for (unsigned i = 0; i < count && entry != nullptr; ++i) {
+    DataQueue* next = Runtime::sends()->getNext(entry);
+    Q_DeleteArray(entry->pBuffer);
+    entry->pBuffer = nullptr;
+    entry->wsaBuf.buf = nullptr;
+    N_Socket* socket = entry->pSocket;
+    if (socket != nullptr && !socket->m_bWritable && socket->m_bWriteCompletionPending) {
+      socket->m_bWritable = true;
+      socket->m_bWriteCompletionPending = false;
+    }
+    if (socket != nullptr) {
+      socket->m_uQueuedSendBytes -= entry->wsaBuf.len;
+      --socket->m_uQueuedSendMessages;
+      socket->m_uBytesSent += entry->wsaBuf.len;
+      if (entry->bMessageEnd) ++socket->m_uMessagesSent;
+    }
+    Runtime::sendDone(entry);
+    entry = next;
   }
-  if (socket != nullptr) {
-    socket->m_uQueuedSendBytes -= entry->wsaBuf.len;
-    --socket->m_uQueuedSendMessages;
-    socket->m_uBytesSent += entry->wsaBuf.len;
-    if (entry->bMessageEnd) ++socket->m_uMessagesSent;
-  }
-  Runtime::sendDone(entry);
 }

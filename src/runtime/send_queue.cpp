@@ -90,7 +90,18 @@ void N_Initializer::pumpSends() {
         entry = nullptr;
       }
     } else if (!entry->bIssued && socket->m_bWritable && socket->m_uPumpHeldPass != pass) {
-      socket->issueSend(entry, pass, nullptr);
+      // The socket's entries that follow go in the same WSASend, up to its
+      // eight buffers; not on UDP, where each WSASend is one datagram.
+      N_Socket::DataQueue* last = entry;
+      unsigned count = 1;
+      while (socket->m_socketType == N_Socket::SOCKET_TCP && count < N_Socket::kJoinedSends) {
+        N_Socket::DataQueue* more = queue->getNext(last);
+        if (more == nullptr || more->pSocket != socket || more->bIssued) break;
+        last = more;
+        ++count;
+      }
+      socket->issueSend(entry, count, pass, nullptr);
+      next = queue->getNext(last);
     }
     if (entry != nullptr && firstUnsettled == nullptr && (!entry->bIssued || entry->pSocket == nullptr))
       firstUnsettled = entry;
