@@ -32,40 +32,52 @@ void N_Socket::send(void* data, unsigned int size) {
   // The copies are made before the lock is taken: a large message then holds
   // up the network thread only for the appends, which is what keeps the
   // entries of one message together and in order.
-  std::vector<Chunk> chunks;
+  // A message of one chunk, most of them, needs no list of its own.
+  Chunk one[1];
+  std::vector<Chunk> many;
+  Chunk* chunks = one;
+  std::size_t count = 0;
   try {
     if (!m_bPackage) {
       if (size > limit) Q_ThrowPacketTooBig(static_cast<int>(size), m_iMaximumSendPacketSize);
-      chunks.push_back({Q_NewArray<char>(size), size});
-      if (size > 0) std::memcpy(chunks.back().buffer, bytes, size);
+      // Counted once allocated: a failed allocation leaves nothing to free.
+      char* buffer = Q_NewArray<char>(size);
+      chunks[count++] = {buffer, size};
+      if (size > 0) std::memcpy(buffer, bytes, size);
     } else {
       unsigned int chunkLimit = limit > kChunkReserve ? limit - kChunkReserve : 1;
       unsigned int chunk = size < chunkLimit ? size : chunkLimit;
-      chunks.reserve(size / chunkLimit + 1);
-      chunks.push_back({Q_NewArray<char>(static_cast<std::size_t>(chunk) + 4), chunk + 4});
+      const std::size_t needed = 1 + (std::size_t{size} - chunk + chunkLimit - 1) / chunkLimit;
+      if (needed > 1) {
+        many.resize(needed);
+        chunks = many.data();
+      }
+      char* first = Q_NewArray<char>(static_cast<std::size_t>(chunk) + 4);
+      chunks[count++] = {first, chunk + 4};
       // The whole message's size, however many chunks follow.
-      little_endian::put32(chunks.back().buffer, size);
-      if (chunk > 0) std::memcpy(chunks.back().buffer + 4, bytes, chunk);
+      little_endian::put32(first, size);
+      if (chunk > 0) std::memcpy(first + 4, bytes, chunk);
       for (unsigned int offset = chunk; offset < size;) {
         unsigned int c = size - offset < chunkLimit ? size - offset : chunkLimit;
-        chunks.push_back({Q_NewArray<char>(c), c});
-        std::memcpy(chunks.back().buffer, bytes + offset, c);
+        char* buffer = Q_NewArray<char>(c);
+        chunks[count++] = {buffer, c};
+        std::memcpy(buffer, bytes + offset, c);
         offset += c;
       }
     }
   } catch (const std::bad_alloc&) {
-    // The list of chunks itself could not grow: reported like any allocation.
-    for (const Chunk& c : chunks) Q_DeleteArray(c.buffer);
+    // The list of chunks itself could not be made: reported like any allocation.
+    for (std::size_t i = 0; i < count; ++i) Q_DeleteArray(chunks[i].buffer);
     Q_ThrowAllocation();
   } catch (...) {
-    for (const Chunk& c : chunks) Q_DeleteArray(c.buffer);
+    for (std::size_t i = 0; i < count; ++i) Q_DeleteArray(chunks[i].buffer);
     throw;
   }
 
   platform::SOCKET socket = 0;
   // The write itself is made outside the runtime's mutex, so that the
   // network thread, which the bytes may wake, need not wait for it.
-  if (sendQueued(chunks.data(), chunks.size(), socket)) platform::WSAFlushSends(socket);
+  if (sendQueued(chunks, count, socket)) platform::WSAFlushSends(socket);
 }
 
 bool N_Socket::sendQueued(const Chunk* chunks, std::size_t count, platform::SOCKET& socket) {

@@ -164,6 +164,7 @@ void N_Initializer::start() {
   if (m_udpProtocol == nullptr) Q_Throw<N_NetException_NoUDP>();
 
   m_eventRelease = platform::WSACreateEvent();
+  Runtime::released() = false;
   // Once for the thread's life, never per pass: at the larger sizes the set
   // is too big for the thread's stack. Winsock's 64 take no allocation, so
   // the default start counts exactly what it always did.
@@ -338,6 +339,7 @@ unsigned int N_Initializer::threadNetwork(void*) {
       // pass builds the wait set anew.
     } else if (index == 0) {
       platform::WSAResetEvent(events[0]);
+      Runtime::released() = false;
     } else if (index < count) {
       try {
         serveEvent(events[index]);

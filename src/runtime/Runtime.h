@@ -21,7 +21,15 @@ class Runtime {
   static platform::HANDLE mutex() { return N_Initializer::m_hMutex; }
   // Makes the network thread build its wait set again: after a list changed,
   // or before a handle that its wait may hold is closed.
-  static void wake() { N_Initializer::releaseThreadLoop(); }
+  static void wake() {
+    // Set already, the event still ends the thread's next wait: the thread
+    // clears the mark when it resets the event, both under the mutex.
+    if (released()) return;
+    released() = true;
+    N_Initializer::releaseThreadLoop();
+  }
+  // Whether the release event was set by wake() and not reset since.
+  static bool& released();
 
   static platform::WSAPROTOCOL_INFOA* provider(bool stream) {
     return stream ? N_Initializer::m_tcpProtocol : N_Initializer::m_udpProtocol;

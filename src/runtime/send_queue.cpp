@@ -38,6 +38,11 @@ void Runtime::sendsQueued(N_Socket::DataQueue* pumpFrom, unsigned bytes) {
   wake();
 }
 
+bool& Runtime::released() {
+  static bool set = false;
+  return set;
+}
+
 void*& Runtime::networkQueue() {
   static void* queue = nullptr;
   return queue;
