@@ -4,7 +4,7 @@
 //
 //   vardel_bench [--quick] [--rounds N] [--json FILE]
 //   vardel_bench --scaling [--seconds S] [--sizes 20,50,100,200] [--json FILE]
-//   vardel_bench --size BYTES | --round-trip | --memory   (the library alone)
+//   vardel_bench --size BYTES | --round-trip | --memory | --idle   (the library alone)
 //
 // Throughput is one-way, every message checked (size, content, order) at the
 // receiver. The round trip is a 32-byte message echoed by the peer. Each
@@ -16,12 +16,13 @@
 // After the table and the client and server figures come the library's heap
 // bytes per idle connection end and per message queued behind a peer that
 // doesn't read. --size, --round-trip and --memory measure one figure of the
-// library alone, for profiling.
+// library alone, for profiling; --idle the CPU that idle connections take.
 //
 // --scaling measures instead a server with many client processes at each
 // size (bench_scaling.cpp), and the platform layer's wait beside 64 to 4096
 // handles (bench_wait.cpp); bench/plot_scaling.py draws its JSON.
 #include <malloc.h>
+#include <sys/resource.h>
 
 #include <atomic>
 #include <chrono>
@@ -226,6 +227,29 @@ void libraryMemory() {
   bench::closeSilentPeer(peer);
 }
 
+// CPU time of the whole process (every thread) while 20 connected socket
+// pairs have nothing to do for 10 s.
+void libraryIdle() {
+  constexpr int kPairs = 20;
+  int port = bench::freePort();
+  N_Listener listener(port);
+  N_Address address("127.0.0.1");
+  std::vector<std::unique_ptr<N_Socket>> ends;
+  for (int i = 0; i < 2 * kPairs; ++i) ends.push_back(std::make_unique<N_Socket>());
+  for (int i = 0; i < kPairs; ++i)
+    if (!connectPair(listener, address, port, *ends[2 * i], *ends[2 * i + 1])) return;
+  platform::Sleep(200);
+  const auto cpu = [] {
+    rusage usage{};
+    getrusage(RUSAGE_SELF, &usage);
+    return (usage.ru_utime.tv_sec + usage.ru_stime.tv_sec) * 1e3 +
+           (usage.ru_utime.tv_usec + usage.ru_stime.tv_usec) / 1e3;
+  };
+  const double before = cpu();
+  platform::Sleep(10000);
+  std::printf("Idle: %d connected socket pairs, %.1f ms of CPU in 10 s\n", kPairs, cpu() - before);
+}
+
 struct Transport {
   std::string name;
   bench::Throughput (*throughput)(std::size_t size, std::size_t count);
@@ -306,6 +330,7 @@ int main(int argc, char** argv) {
   std::size_t only = 0;  // --size N: one throughput case of the library alone, for profiling
   bool roundTripOnly = false;  // --round-trip: the library's round trip alone, for profiling
   bool memoryOnly = false;     // --memory: the library's heap figures alone
+  bool idleOnly = false;       // --idle: CPU of idle connections over 10 s
   for (int i = 1; i < argc; ++i) {
     if (std::strcmp(argv[i], "--quick") == 0) {
       quick = true;
@@ -313,6 +338,8 @@ int main(int argc, char** argv) {
       roundTripOnly = true;
     } else if (std::strcmp(argv[i], "--memory") == 0) {
       memoryOnly = true;
+    } else if (std::strcmp(argv[i], "--idle") == 0) {
+      idleOnly = true;
     } else if (std::strcmp(argv[i], "--size") == 0 && i + 1 < argc) {
       only = std::strtoul(argv[++i], nullptr, 10);
     } else if (std::strcmp(argv[i], "--rounds") == 0 && i + 1 < argc) {
@@ -321,7 +348,7 @@ int main(int argc, char** argv) {
       json = argv[++i];
     } else {
       std::fprintf(stderr,
-                   "usage: %s [--quick] [--rounds N] [--json FILE] | --size BYTES | --round-trip | --memory\n"
+                   "usage: %s [--quick] [--rounds N] [--json FILE] | --size BYTES | --round-trip | --memory | --idle\n"
                    "       %s --scaling [--seconds S] [--sizes N,N,...] [--json FILE]\n",
                    argv[0], argv[0]);
       return 2;
@@ -332,6 +359,10 @@ int main(int argc, char** argv) {
     bench::Throughput lib = libraryThroughput(only, (64u << 20) / (only + 64));
     std::printf("%zu bytes: %.0f msg/s, %.1f MB/s%s\n", only, lib.messagesPerSecond, lib.megabytesPerSecond,
                 lib.verified ? "" : " (VERIFY FAILED)");
+    return 0;
+  }
+  if (idleOnly) {
+    libraryIdle();
     return 0;
   }
   if (memoryOnly) {
