@@ -299,4 +299,20 @@ TEST_F(ClientQueueTest, ReadingWithTheSimulatedDelay) {
   }
 }
 
+// Under the network model a reliable message is timed from the read that
+// took it from the socket, however long it waited there before.
+TEST_F(ClientQueueTest, TheNetworkModelTimesAMessageFromTheReadThatTookItIn) {
+  N_Client::simulateNetwork({.fDelay = 1000});
+  void* m = nullptr;
+  unsigned n = 0;
+  EXPECT_FALSE(client().poll(m, n));
+  peerSends("late");
+  ASSERT_TRUE(waitFor([&] { return Access::tcpSocket(client())->getQueuedReceiveMessages() == 1; }));
+  sleepMs(1500);  // longer than the delay since the read before
+  EXPECT_FALSE(client().poll(m, n)) << "read at once";
+  EXPECT_EQ(1u, client().getSimulationStats().uReceived);
+  ASSERT_TRUE(waitFor([&] { return client().poll(m, n); }, 5000));
+  EXPECT_EQ("late", std::string(static_cast<const char*>(m), n));
+}
+
 }  // namespace

@@ -44,17 +44,10 @@ std::vector<char> control(std::uint32_t type, std::uint32_t value) {
 
 }  // namespace
 
-RawPeer::RawPeer(bool server, const char* ip, const char* peerIp, std::uint16_t port)
-    : m_start(std::chrono::steady_clock::now()) {
-  if (server) {
-    std::uint16_t controlPort = kControlPort;
-    m_dataListener = raw::listenOn(ip, port);
-    m_controlListener = raw::listenOn(ip, controlPort);
-  } else {
-    m_data = raw::connectTo(peerIp, port, ip);
-    m_control = raw::connectTo(peerIp, kControlPort, ip);
-    m_bConnected = m_data >= 0 && m_control >= 0;
-  }
+RawPeer::RawPeer(const char* ip, const char* peerIp, std::uint16_t port) : m_start(std::chrono::steady_clock::now()) {
+  std::uint16_t controlPort = kControlPort;
+  m_dataListener = raw::listenOn(ip, port);
+  m_controlListener = raw::listenOn(ip, controlPort);
   m_udp = raw::udpBound(ip, static_cast<std::uint16_t>(port + 1));
   sockaddr_in to{};
   to.sin_family = AF_INET;
@@ -75,12 +68,9 @@ void RawPeer::run() {
   char datagram[65536];
   bool dataOpen = true, controlOpen = true;
   while (!m_bStop) {
-    if (!m_bConnected) {
-      if (m_data < 0) m_data = raw::acceptOne(m_dataListener, 1);
-      if (m_control < 0) m_control = raw::acceptOne(m_controlListener, 1);
-      if (!m_bConnected && (m_data < 0 || m_control < 0)) continue;
-      m_bConnected = m_data >= 0 && m_control >= 0;
-    }
+    if (m_data < 0) m_data = raw::acceptOne(m_dataListener, 1);
+    if (m_control < 0) m_control = raw::acceptOne(m_controlListener, 1);
+    if (m_data < 0 || m_control < 0) continue;
     pollfd fds[3] = {{dataOpen ? m_data.load() : -1, POLLIN, 0}, {controlOpen ? m_control.load() : -1, POLLIN, 0}, {m_udp, POLLIN, 0}};
     if (::poll(fds, 3, 2) <= 0) continue;
     if (fds[0].revents != 0) dataOpen = readStream(m_data, m_dataPending, m_received.reliable, false);

@@ -33,16 +33,13 @@ struct Direction {
 
 class RawPeer {
  public:
-  // As the server: listens on ip:port and ip:6000, and exchanges datagrams
-  // between ip:port+1 and peerIp:port+1. As the client: connects from ip to
-  // peerIp:port and peerIp:6000, datagrams the same way.
-  RawPeer(bool server, const char* ip, const char* peerIp, std::uint16_t port);
+  // The server: listens on ip:port and ip:6000, and exchanges datagrams
+  // between ip:port+1 and peerIp:port+1.
+  RawPeer(const char* ip, const char* peerIp, std::uint16_t port);
   ~RawPeer();
   RawPeer(const RawPeer&) = delete;
   RawPeer& operator=(const RawPeer&) = delete;
 
-  // Both streams are accepted (server) or connected (client).
-  bool connected() const { return m_bConnected; }
   // One packaged message of `size` bytes of `fill` on the data stream.
   void sendReliable(std::size_t size, char fill);
   void sendUnreliable(std::size_t size, char fill);
@@ -68,7 +65,6 @@ class RawPeer {
   // Set by the thread when accepted, read by the senders.
   std::atomic<int> m_data{-1}, m_control{-1};
   int m_udp = -1;
-  std::atomic<bool> m_bConnected{false};
   std::atomic<bool> m_bStop{false};
   std::mutex m_write;  // one writer at a time on each stream
   std::mutex m_lock;   // the tallies

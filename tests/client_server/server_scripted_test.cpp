@@ -3,6 +3,7 @@
 // message the server sends is seen as bytes.
 #include "cs_fixture.h"
 #include "raw_socket.h"
+#include "win32.h"
 #include "winsock.h"
 
 using namespace cs_test;
@@ -144,43 +145,30 @@ TEST_F(ServerScriptedTest, GrantsOnTheWire) {
   // Lowering the cap sends the new grants at once.
   server.setMaximumBandwidthUsage(2);
   for (auto& s : scripted) EXPECT_EQ(0u, s->lastGrant({}));
-}
 
-TEST_F(ServerScriptedTest, DisconnectClientGivesTheShareBackInTheSameCall) {
-  heartbeat(0.0f, 1.0f);
-  N_Server server(port());
+  // disconnectClient gives the share back and sends the new grants in the same call.
   server.setMaximumBandwidthUsage(60000);
-  server.setBandwidth(100000);
-  ServerPump pump{server};
-  ScriptedClient a(loopback(), port());
-  N_Client* ca = pairUp(pump, a);
-  ScriptedClient b(loopback(), port());
-  N_Client* cb = pairUp(pump, b);
-  ASSERT_TRUE(ca && cb);
-  a.send(CM::CONTROL_BANDWIDTH_REQUEST, 60000);
-  b.send(CM::CONTROL_BANDWIDTH_REQUEST, 60000);
-  EXPECT_EQ(50000u, b.lastGrant(pump));
-  EXPECT_EQ(50000u, ca->getBandwidth());
-  server.disconnectClient(ca);
-  EXPECT_EQ(60000u, cb->getBandwidth());
-  EXPECT_EQ(60000u, b.lastGrant({}));
-  EXPECT_TRUE(closed(a));
+  server.setBandwidth(120000);
+  for (auto& s : scripted) s->send(CM::CONTROL_BANDWIDTH_REQUEST, 60000);
+  EXPECT_EQ(40000u, scripted[2]->lastGrant(pump));
+  server.disconnectClient(clients[0]);
+  EXPECT_EQ(60000u, clients[1]->getBandwidth());
+  EXPECT_EQ(60000u, scripted[1]->lastGrant({}));
+  EXPECT_TRUE(closed(*scripted[0]));
   // A pointer the server doesn't hold: nothing freed, grants sent again.
   N_Client stranger;
   server.disconnectClient(&stranger);
-  EXPECT_EQ(60000u, b.lastGrant({}));
-  EXPECT_EQ(1, ServerAccess::clientCount(server));
+  EXPECT_EQ(60000u, scripted[1]->lastGrant({}));
+  EXPECT_EQ(2, ServerAccess::clientCount(server));
   // A refused allocation doesn't make it throw; the grant that couldn't go
   // goes with the next update.
-  ScriptedClient c(loopback(), port());
-  ASSERT_NE(nullptr, pairUp(pump, c));
-  c.send(CM::CONTROL_BANDWIDTH_REQUEST, 60000);
-  EXPECT_EQ(50000u, c.lastGrant(pump));
+  server.setBandwidth(100000);
+  EXPECT_EQ(50000u, scripted[2]->lastGrant(pump));
   failAllocation(1, true);
-  EXPECT_NO_THROW(server.disconnectClient(cb));
+  EXPECT_NO_THROW(server.disconnectClient(clients[1]));
   platform::fault::disarmAll();
   EXPECT_EQ(1, ServerAccess::clientCount(server));
-  EXPECT_EQ(60000u, c.lastGrant(pump));
+  EXPECT_EQ(60000u, scripted[2]->lastGrant(pump));
 }
 
 TEST_F(ServerScriptedTest, ClientsAreHandedOutOnceAfterPairingAndGoWithDestruct) {
@@ -421,10 +409,14 @@ TEST_F(ServerLimitsTest, ControlWorkIsBudgetedAndRequestsCollected) {
   EXPECT_TRUE(b.drain(200, pump).empty()) << "b's grant didn't change";
 }
 
-TEST_F(ServerLimitsTest, AClientThatDoesNotReadIsDisconnected) {
+// A client whose unsent bytes exceed the bound is disconnected; at exactly
+// the bound it stays. The scripted end stops reading, so the bytes stay
+// queued; the network thread is held while the bound is set at their cost.
+TEST_F(ServerLimitsTest, AClientThatDoesNotReadIsDisconnectedAboveTheBound) {
   N_Limits l = N_Limits::openNetwork();
-  l.uReceiveBacklog = 64 << 10;  // the scripted end stops reading
-  l.fSendBacklogSeconds = 0.5f;
+  l.uReceiveBacklog = 64 << 10;
+  l.fSendBacklogSeconds = 1e-6f;  // the minimum rules
+  l.uMinimumSendBacklog = 1u << 30;
   LimitsGuard guard(l);
   N_Server server(port());
   ServerPump pump{server};
@@ -433,9 +425,20 @@ TEST_F(ServerLimitsTest, AClientThatDoesNotReadIsDisconnected) {
   ASSERT_NE(nullptr, client);
   std::vector<unsigned char> block(64 << 10, 7);
   N_Socket* out = Access::tcpSocket(*client);
-  // Far more than half a second of 1250000 bytes/s plus the system buffers.
-  for (int i = 0; i < 64; ++i) out->send(block.data(), static_cast<unsigned>(block.size()));
-  EXPECT_TRUE(waitFor([&] { return !client->isConnected(); }, 5000, pump));
+  for (int i = 0; i < 256; ++i) out->send(block.data(), static_cast<unsigned>(block.size()));
+  unsigned last = 0;  // steady once the system's buffers are full
+  ASSERT_TRUE(waitFor([&] { const unsigned now = out->getQueuedSendBytes(); return now > 0 && std::exchange(last, now) == now; },
+                      10000, [&] { pumpFor(100, pump); }));
+  platform::HANDLE network = platform::CreateMutexA(nullptr, platform::FALSE, "Kelvane network mutex");
+  platform::WaitForSingleObject(network, platform::INFINITE);
+  const unsigned cost = out->getQueuedSendBytes() + N_Limits::kMessageCharge * out->getQueuedSendMessages();
+  for (unsigned bound : {cost, cost - 1}) {
+    l.uMinimumSendBacklog = bound;
+    N_Initializer::setLimits(l);
+    server.update();
+    EXPECT_EQ(bound == cost, client->isConnected()) << bound << " of " << cost;
+  }
+  platform::ReleaseMutex(network), platform::CloseHandle(network);
   const N_Socket* reported = nullptr;
   bool tcpReported = false;
   while (N_Socket::pollDisconnect(reported)) tcpReported |= reported == out;

@@ -4,8 +4,7 @@
 // every millisecond. It prints "connected" / "lost" as isConnected() changes,
 // "bandwidth N" and "latency X" as they change, "recv N TEXT" for each
 // message, "flushed", "error TEXT", and "bye" at "quit". Commands:
-//   limits                    prints "limits LARGEST", the largest unreliable size
-//   stall SECONDS | bandwidth N | fr | fu (flush reliable / unreliable once)
+//   bandwidth N | fr | fu (flush reliable / unreliable once)
 //   qrn KEY PRIO SIZE CHAR | qun ...   queue SIZE copies of CHAR, reliable / unreliable
 //   send-r COUNT PREFIX [MS [stamp]] | send-u ...
 //        COUNT payloads "PREFIX<i>;", each once the queue is empty again and
@@ -103,13 +102,7 @@ struct Probe {
 };
 
 void run(N_Client& client, std::istringstream& in, const std::string& command, Sender* senders, Probe& probe) {
-  if (command == "limits") {
-    say("limits " + std::to_string(client.getLargestUnreliablePacketSize()));
-  } else if (command == "stall") {
-    double seconds = 0;
-    in >> seconds;
-    std::this_thread::sleep_for(std::chrono::duration<double>(seconds));
-  } else if (command == "bandwidth") {
+  if (command == "bandwidth") {
     unsigned value = 0;
     in >> value;
     client.setBandwidth(value);
