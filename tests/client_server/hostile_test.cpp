@@ -26,13 +26,12 @@ using namespace cs_test;
 
 namespace {
 
+// Sanitizer allocators keep freed memory: RSS says nothing there.
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
 constexpr bool kSanitized = true;
 #else
 constexpr bool kSanitized = false;
 #endif
-// Sanitizer allocators keep freed memory: RSS says nothing there.
-constexpr bool kRssMeaningful = !kSanitized;
 // Once the attacker has gone, all it opened is closed and due at the next
 // update; what a pairing time-out (5 s) holds, soon after.
 constexpr int kSettleMs = (5000 + 3000) * (kSanitized ? 4 : 1);
@@ -98,19 +97,12 @@ struct Attack {
 
 class HostileTest : public ClientServerTest {
  protected:
-  void SetUp() override {
-    ClientServerTest::SetUp();
-    N_Initializer::setLimits(N_Limits::openNetwork());
-    heartbeat(0.5f, 4.0f);  // slow enough for sanitizer builds on a loaded machine
-  }
-  void TearDown() override {
-    ClientServerTest::TearDown();
-    N_Initializer::setLimits(N_Limits::defaults());
-  }
   void run(const Attack& a);
 };
 
 void HostileTest::run(const Attack& a) {
+  LimitsGuard protect(N_Limits::openNetwork());
+  heartbeat(0.5f, 4.0f);  // slow enough for sanitizer builds on a loaded machine
   // The server under attack, run the way an application would: update, the
   // hand-outs, echoes, disconnectClient for whatever is no longer connected.
   N_Server server(port());
@@ -143,8 +135,8 @@ void HostileTest::run(const Attack& a) {
   for (int host : {2, 3}) ASSERT_TRUE(join(host));
   pumpFor(1000, pump);
   auto level = [&] {
-    if (kRssMeaningful) ::malloc_trim(0);  // glibc keeps freed pages; trimmed, RSS shows what is held
-    return std::pair{outstanding(), kRssMeaningful ? rssBytes() : 0};
+    if (!kSanitized) ::malloc_trim(0);  // glibc keeps freed pages; trimmed, RSS shows what is held
+    return std::pair{outstanding(), !kSanitized ? rssBytes() : 0};
   };
   const auto before = level();
   for (auto& p : peers) probe(*p, "report", pump);

@@ -266,21 +266,6 @@ TEST_F(ServerScriptedTest, AFailedAcceptLeavesNoEntry) {
   }
 }
 
-// An accept that failed for lack of descriptors never becomes a client and
-// costs no update an exception; the connection is taken once accepts work.
-TEST_F(ServerScriptedTest, AnAcceptWithoutDescriptorsNeverBecomesAClient) {
-  N_Server server(port());
-  ServerPump pump{server};
-  FaultGuard faults(platform::fault::Call::WSAAccept, {1, true, platform::WSAEMFILE});
-  ScriptedClient a(loopback(), port(), true, false);
-  EXPECT_NO_THROW(pumpFor(600, pump));
-  EXPECT_GE(platform::fault::fired(platform::fault::Call::WSAAccept), 1);
-  EXPECT_EQ(0, ServerAccess::clientCount(server));
-  platform::fault::disarm(platform::fault::Call::WSAAccept);
-  a.openControl();
-  EXPECT_NE(nullptr, pairUp(pump, a));
-}
-
 // The server under N_Limits. Heartbeats are off: the scripted ends don't
 // answer them.
 class ServerLimitsTest : public ServerScriptedTest {
