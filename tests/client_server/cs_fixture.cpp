@@ -35,59 +35,6 @@ void ClientServerTest::TearDown() {
   RuntimeTest::TearDown();
 }
 
-ScriptedServer::ScriptedServer(int port) : m_dataListener(port), m_controlListener(CM::CONTROL_PORT) {
-  m_thread = std::thread([this] {
-    for (; !m_bStop; std::this_thread::sleep_for(std::chrono::microseconds(200))) {
-      std::lock_guard<std::mutex> hold(m_lock);
-      N_Socket::ConnectData* entry = nullptr;
-      if (!m_data && m_dataListener.pollConnect(entry)) m_data = std::make_unique<N_Socket>(entry);
-      if (!m_control && m_controlListener.pollConnect(entry)) m_control = std::make_unique<N_Socket>(entry);
-      void* message = nullptr;
-      unsigned size = 0;
-      while (m_control && m_control->poll(message, size)) {
-        const Received& r = m_received.emplace_back(parse(message, size));
-        Bytes reply;
-        if (r.type == CM::CONTROL_HEARTBEAT && answerHeartbeats) reply = controlBytes(CM::CONTROL_HEARTBEAT_REPLY);
-        if (r.type == CM::CONTROL_WORLD_TIME_REQUEST && worldTimeAnswers != 0) {
-          if (worldTimeAnswers > 0) --worldTimeAnswers;
-          reply = controlBytes(CM::CONTROL_WORLD_TIME, CM::floatBits(worldTimeValue.load()));
-        }
-        if (!reply.empty()) m_control->send(reply.data(), static_cast<unsigned>(reply.size()));
-      }
-    }
-  });
-}
-
-ScriptedServer::~ScriptedServer() {
-  m_bStop = true;
-  m_thread.join();
-}
-
-std::vector<Received> ScriptedServer::control() {
-  std::lock_guard<std::mutex> hold(m_lock);
-  return m_received;
-}
-
-std::size_t ScriptedServer::count(std::uint32_t type) {
-  const std::vector<Received> all = control();
-  return std::count_if(all.begin(), all.end(), [&](const Received& r) { return r.type == type; });
-}
-
-bool ScriptedServer::connected(bool control) {
-  std::lock_guard<std::mutex> hold(m_lock);
-  const std::unique_ptr<N_Socket>& s = control ? m_control : m_data;
-  return s && s->isConnected();
-}
-
-void ScriptedServer::sendControl(const Bytes& bytes) {
-  std::lock_guard<std::mutex> hold(m_lock);
-  if (m_control) m_control->send(const_cast<unsigned char*>(bytes.data()), static_cast<unsigned>(bytes.size()));
-}
-
-bool ScriptedServer::waitControl(std::size_t count, int milliseconds, const Pump& pump) {
-  return waitFor([&] { return control().size() >= count; }, milliseconds, pump);
-}
-
 ScriptedClient::ScriptedClient(const N_Address* server, int port, bool openDataNow, bool openControlNow)
     : m_pServer(server), m_iPort(port) {
   if (openDataNow) openData();

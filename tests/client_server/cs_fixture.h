@@ -1,8 +1,8 @@
 // Shared pieces of the client and server tests: the runtime fixture with the
 // client settings put back, white-box hooks for the heartbeat timers and the
-// pacing gates, scripted server and client ends made of plain N_Sockets (for
-// the exact bytes of the control channel), and client host processes (for
-// the unreliable channel and for several clients at once).
+// pacing gates, a scripted client end made of plain N_Sockets (for the exact
+// bytes of the control channel; the server end is raw_peer.h), and client
+// host processes (for the unreliable channel and for several clients at once).
 #pragma once
 
 #include <atomic>
@@ -21,6 +21,7 @@
 #include "N_Server.h"
 #include "N_Socket.h"
 #include "child_process.h"
+#include "raw_peer.h"
 #include "runtime_test.h"
 
 // Timer ages for the heartbeat limits and the pacing gates, which the public
@@ -70,39 +71,8 @@ class ClientServerTest : public RuntimeTest {
   }
 };
 
-// One received control message, as the scripted ends record it.
-struct Received {
-  unsigned size;
-  std::uint32_t type, value;
-};
-
-// The server end played by plain sockets on a thread of its own: it accepts
-// the data connection on `port` and the control connection on 6000, records
-// every control message, and answers heartbeats and world-time requests by
-// its policy.
-class ScriptedServer {
- public:
-  explicit ScriptedServer(int port);
-  ~ScriptedServer();
-
-  std::atomic<bool> answerHeartbeats{true};
-  std::atomic<int> worldTimeAnswers{-1};  // how many more to answer; -1: all
-  std::atomic<float> worldTimeValue{100.0f};
-
-  std::vector<Received> control();
-  std::size_t count(std::uint32_t type);
-  bool connected(bool control);
-  void sendControl(const Bytes& bytes);
-  bool waitControl(std::size_t count, int milliseconds, const Pump& pump);
-
- private:
-  N_Listener m_dataListener, m_controlListener;
-  std::mutex m_lock;
-  std::unique_ptr<N_Socket> m_data, m_control;
-  std::vector<Received> m_received;
-  std::atomic<bool> m_bStop{false};
-  std::thread m_thread;
-};
+using raw_peer::Received;
+using raw_peer::RawPeer;
 
 // The client end played by plain sockets on the test thread: a data
 // connection to `port` and a control connection to 6000.

@@ -35,7 +35,7 @@ std::vector<char> framed(const std::vector<char>& body) {
   return out;
 }
 
-std::vector<char> control(std::uint32_t type, std::uint32_t value) {
+std::vector<char> controlMessage(std::uint32_t type, std::uint32_t value) {
   std::vector<char> body;
   putWord(body, type);
   if (type == 1 || type == 2 || type == kWorldTime) putWord(body, value);
@@ -66,15 +66,14 @@ RawPeer::~RawPeer() {
 
 void RawPeer::run() {
   char datagram[65536];
-  bool dataOpen = true, controlOpen = true;
   while (!m_bStop) {
-    if (m_data < 0) m_data = raw::acceptOne(m_dataListener, 1);
-    if (m_control < 0) m_control = raw::acceptOne(m_controlListener, 1);
-    if (m_data < 0 || m_control < 0) continue;
-    pollfd fds[3] = {{dataOpen ? m_data.load() : -1, POLLIN, 0}, {controlOpen ? m_control.load() : -1, POLLIN, 0}, {m_udp, POLLIN, 0}};
+    if (m_data < 0 && (m_data = raw::acceptOne(m_dataListener, 1)) >= 0) m_bDataOpen = true;
+    if (m_control < 0 && (m_control = raw::acceptOne(m_controlListener, 1)) >= 0) m_bControlOpen = true;
+    pollfd fds[3] = {{m_bDataOpen ? m_data.load() : -1, POLLIN, 0}, {m_bControlOpen ? m_control.load() : -1, POLLIN, 0},
+                     {m_udp, POLLIN, 0}};
     if (::poll(fds, 3, 2) <= 0) continue;
-    if (fds[0].revents != 0) dataOpen = readStream(m_data, m_dataPending, m_received.reliable, false);
-    if (fds[1].revents != 0) controlOpen = readStream(m_control, m_controlPending, m_received.control, true);
+    if (fds[0].revents != 0) m_bDataOpen = readStream(m_data, m_dataPending, m_received.reliable, false);
+    if (fds[1].revents != 0) m_bControlOpen = readStream(m_control, m_controlPending, m_received.control, true);
     if (fds[2].revents & POLLIN) {
       const ssize_t n = ::recv(m_udp, datagram, sizeof datagram, MSG_DONTWAIT);
       std::lock_guard<std::mutex> hold(m_lock);
@@ -97,22 +96,23 @@ bool RawPeer::readStream(int fd, std::vector<char>& pending, Tally& tally, bool 
     tally.bytes += static_cast<std::uint64_t>(n);
     pending.insert(pending.end(), buffer, buffer + n);
     while (pending.size() >= 4 && pending.size() >= 4 + std::size_t{word(pending.data())}) {
-      const std::size_t length = word(pending.data());
+      const std::uint32_t length = word(pending.data());
       ++tally.messages;
-      if (isControl && length >= 4) {
-        types.push_back(word(pending.data() + 4));
-        m_controlTypes.push_back(types.back());
+      if (isControl) {
+        const Received& r = m_controlReceived.emplace_back(Received{
+            length, length >= 4 ? word(pending.data() + 4) : 0, length >= 8 ? word(pending.data() + 8) : 0});
+        types.push_back(r.type);
       }
       pending.erase(pending.begin(), pending.begin() + static_cast<std::ptrdiff_t>(4 + length));
     }
   }
   for (std::uint32_t type : types) {
-    if (type == kHeartbeat) {
-      sendControl(kHeartbeatReply);
-      sendControl(kHeartbeat);
-    } else if (type == kWorldTimeRequest) {
-      const float now =
-          worldTime.load() + std::chrono::duration<float>(std::chrono::steady_clock::now() - m_start).count();
+    if (type == kHeartbeat && answerHeartbeats) sendControl(kHeartbeatReply);
+    if (type == kHeartbeat && answerHeartbeats && heartbeatBack) sendControl(kHeartbeat);
+    if (type == kWorldTimeRequest && worldTimeAnswers != 0) {
+      if (worldTimeAnswers > 0) --worldTimeAnswers;
+      const float now = worldTime.load() +
+                        (worldTimeRuns ? std::chrono::duration<float>(std::chrono::steady_clock::now() - m_start).count() : 0.0f);
       std::uint32_t bits;
       std::memcpy(&bits, &now, sizeof bits);
       sendControl(kWorldTime, bits);
@@ -140,7 +140,11 @@ void RawPeer::sendUnreliable(std::size_t size, char fill) {
 }
 
 void RawPeer::sendControl(std::uint32_t type, std::uint32_t value) {
-  send(m_control, control(type, value), m_sent.control);
+  send(m_control, controlMessage(type, value), m_sent.control);
+}
+
+void RawPeer::sendControlBytes(const std::vector<unsigned char>& body) {
+  send(m_control, framed(std::vector<char>(body.begin(), body.end())), m_sent.control);
 }
 
 Direction RawPeer::sent() {
@@ -153,10 +157,15 @@ Direction RawPeer::received() {
   return m_received;
 }
 
-unsigned RawPeer::controlCount(std::uint32_t type) {
+std::vector<Received> RawPeer::control() {
   std::lock_guard<std::mutex> hold(m_lock);
-  unsigned n = 0;
-  for (unsigned t : m_controlTypes) n += t == type;
+  return m_controlReceived;
+}
+
+std::size_t RawPeer::count(std::uint32_t type) {
+  std::lock_guard<std::mutex> hold(m_lock);
+  std::size_t n = 0;
+  for (const Received& r : m_controlReceived) n += r.type == type;
   return n;
 }
 

@@ -6,10 +6,8 @@
 #include <tuple>
 
 #include "cs_fixture.h"
-#include "raw_peer.h"
 
 using namespace cs_test;
-using raw_peer::RawPeer;
 
 namespace {
 
@@ -79,6 +77,7 @@ TEST_F(StatisticsTest, ClientEndCountsWhatARawServerSentAndReceived) {
   EXPECT_EQ(0u, idle.getStatistics().reliableQueue.uPayloadsRefused);                  // unconstructed: all 0
 
   RawPeer server("127.0.0.2", "127.0.0.1", static_cast<std::uint16_t>(port()));
+  server.heartbeatBack = true, server.worldTimeRuns = true;
   N_Address serverAddress("127.0.0.2");
   N_Client client(&serverAddress, port());
   const Pump update = [&] { client.update(); };
@@ -153,8 +152,8 @@ TEST_F(StatisticsTest, ClientEndCountsWhatARawServerSentAndReceived) {
   EXPECT_EQ(0u, s.model.uReceived);  // the network model never ran
   EXPECT_EQ(20000u, s.uBandwidth);
   // The control channel carried the two requests and the world-time requests.
-  EXPECT_EQ(2u, server.controlCount(CM::CONTROL_BANDWIDTH_REQUEST));
-  EXPECT_EQ(3u, server.controlCount(CM::CONTROL_WORLD_TIME_REQUEST));
+  EXPECT_EQ(2u, server.count(CM::CONTROL_BANDWIDTH_REQUEST));
+  EXPECT_EQ(3u, server.count(CM::CONTROL_WORLD_TIME_REQUEST));
 
   client.destruct();
   EXPECT_EQ(0u, client.getStatistics().reliable.uBytesSent);
