@@ -232,7 +232,7 @@ TEST_F(ClientQueueTest, QueuesIgnoreTheStateOfTheChannel) {
 // Reading with the simulated delay: each read with the delay on, a message or
 // not, draws the next gate from the thread's generator; a shut gate holds
 // messages and draws nothing. Loss is for the unreliable channel only (the
-// process test checks it): it leaves reliable messages alone.
+// statistics test checks it): it leaves reliable messages alone.
 TEST_F(ClientQueueTest, ReadingWithTheSimulatedDelay) {
   void* m = nullptr;
   unsigned n = 0;
