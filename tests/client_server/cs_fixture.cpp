@@ -1,7 +1,5 @@
 #include "cs_fixture.h"
 
-#include <cstdlib>
-
 namespace cs_test {
 
 Bytes controlBytes(std::uint32_t type, std::uint32_t value, int size) {
@@ -103,11 +101,6 @@ N_Client* PeerProcess::admit(const ServerPump& pump) {
   for (const std::string& line : m_process.lines()) said += "\n  " + line;
   ADD_FAILURE() << m_host << " did not connect; it said:" << said;
   return nullptr;
-}
-
-double valueOf(const std::string& line) {
-  const std::size_t space = line.find(' ');
-  return space == std::string::npos ? 0.0 : std::strtod(line.c_str() + space + 1, nullptr);
 }
 
 }  // namespace cs_test

@@ -137,7 +137,4 @@ class PeerProcess {
   ChildProcess m_process;
 };
 
-// The number after "<word> " in a line such as "bandwidth 35714".
-double valueOf(const std::string& line);
-
 }  // namespace cs_test
