@@ -67,8 +67,14 @@ RawPeer::~RawPeer() {
 void RawPeer::run() {
   char datagram[65536];
   while (!m_bStop) {
-    if (m_data < 0 && (m_data = raw::acceptOne(m_dataListener, 1)) >= 0) m_bDataOpen = true;
-    if (m_control < 0 && (m_control = raw::acceptOne(m_controlListener, 1)) >= 0) m_bControlOpen = true;
+    if (m_data < 0) {
+      m_data = raw::acceptOne(m_dataListener, 1);
+      m_bDataOpen = m_data >= 0;
+    }
+    if (m_control < 0) {
+      m_control = raw::acceptOne(m_controlListener, 1);
+      m_bControlOpen = m_control >= 0;
+    }
     pollfd fds[3] = {{m_bDataOpen ? m_data.load() : -1, POLLIN, 0}, {m_bControlOpen ? m_control.load() : -1, POLLIN, 0},
                      {m_udp, POLLIN, 0}};
     if (::poll(fds, 3, 2) <= 0) continue;
@@ -107,8 +113,10 @@ bool RawPeer::readStream(int fd, std::vector<char>& pending, Tally& tally, bool 
     }
   }
   for (std::uint32_t type : types) {
-    if (type == kHeartbeat && answerHeartbeats) sendControl(kHeartbeatReply);
-    if (type == kHeartbeat && answerHeartbeats && heartbeatBack) sendControl(kHeartbeat);
+    if (type == kHeartbeat && answerHeartbeats) {
+      sendControl(kHeartbeatReply);
+      if (heartbeatBack) sendControl(kHeartbeat);
+    }
     if (type == kWorldTimeRequest && worldTimeAnswers != 0) {
       if (worldTimeAnswers > 0) --worldTimeAnswers;
       const float now = worldTime.load() +

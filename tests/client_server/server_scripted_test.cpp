@@ -412,8 +412,11 @@ TEST_F(ServerLimitsTest, AClientThatDoesNotReadIsDisconnectedAboveTheBound) {
   N_Socket* out = Access::tcpSocket(*client);
   for (int i = 0; i < 256; ++i) out->send(block.data(), static_cast<unsigned>(block.size()));
   unsigned last = 0;  // steady once the system's buffers are full
-  ASSERT_TRUE(waitFor([&] { const unsigned now = out->getQueuedSendBytes(); return now > 0 && std::exchange(last, now) == now; },
-                      10000, [&] { pumpFor(100, pump); }));
+  auto steady = [&] {
+    const unsigned now = out->getQueuedSendBytes();
+    return now > 0 && std::exchange(last, now) == now;
+  };
+  ASSERT_TRUE(waitFor(steady, 10000, [&] { pumpFor(100, pump); }));
   platform::HANDLE network = platform::CreateMutexA(nullptr, platform::FALSE, "Kelvane network mutex");
   platform::WaitForSingleObject(network, platform::INFINITE);
   const unsigned cost = out->getQueuedSendBytes() + N_Limits::kMessageCharge * out->getQueuedSendMessages();
@@ -423,7 +426,8 @@ TEST_F(ServerLimitsTest, AClientThatDoesNotReadIsDisconnectedAboveTheBound) {
     server.update();
     EXPECT_EQ(bound == cost, client->isConnected()) << bound << " of " << cost;
   }
-  platform::ReleaseMutex(network), platform::CloseHandle(network);
+  platform::ReleaseMutex(network);
+  platform::CloseHandle(network);
   const N_Socket* reported = nullptr;
   bool tcpReported = false;
   while (N_Socket::pollDisconnect(reported)) tcpReported |= reported == out;
