@@ -283,7 +283,8 @@ TEST_F(ClientScriptedTest, WithoutAServerOrAnAddress) {
     empty.flushReliable();
     empty.flushUnreliable();
     char byte = 'x';
-    EXPECT_THROW(empty.queueReliable(&byte, 1, 0, 0), N_NetException_PacketsStackingUp*);
+    EXPECT_THROW(empty.queueReliable(&byte, 1, 0, 0), N_NetException_PacketsStackingUp*);  // its limit is 0
+    EXPECT_EQ(0u, empty.getStatistics().reliableQueue.uPayloadsRefused);  // nothing counted unconstructed
     empty.destruct();
     empty.construct(loopback(), port());
     EXPECT_TRUE(empty.isConstructed());
