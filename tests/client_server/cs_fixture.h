@@ -35,7 +35,6 @@ struct N_ClientTestAccess {
   static float nextFlushTime(const N_Client& c) { return c.m_fNextFlushTime; }
   static float nextPollTime(const N_Client& c) { return c.m_fNextPollTime; }
   static float sendAge(const N_Client& c) { return c.m_sendTimer.getAge(); }
-  static N_Socket* controlSocket(const N_Client& c) { return c.m_pControlSocket; }
   static N_Socket* tcpSocket(const N_Client& c) { return c.m_pTcpSocket; }
 };
 
