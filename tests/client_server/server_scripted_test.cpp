@@ -17,45 +17,10 @@ class ServerScriptedTest : public ClientServerTest {
   }
 };
 
-TEST_F(ServerScriptedTest, ControlMessagesAreAnsweredInOrderAndTheRestDropped) {
-  heartbeat(1.0f, 1.0f);
-  N_Server server(port());
-  ServerPump pump{server};
-  ScriptedClient a(loopback(), port());
-  N_Client* client = pairUp(pump, a);
-  ASSERT_NE(nullptr, client);
-  EXPECT_EQ(N_Client::DEFAULT_BANDWIDTH, client->getBandwidth());
-
-  // Not the server's, or too short: nothing comes back for these.
-  for (const Bytes& b : {controlBytes(0, 1), controlBytes(9, 2, 8), controlBytes(CM::CONTROL_BANDWIDTH_GRANT, 99),
-                         controlBytes(CM::CONTROL_ECHO_REPLY), controlBytes(CM::CONTROL_WORLD_TIME, CM::floatBits(3)),
-                         controlBytes(CM::CONTROL_BANDWIDTH_REQUEST, 77, 4),
-                         controlBytes(CM::CONTROL_BANDWIDTH_REQUEST, 78, 7), controlBytes(CM::CONTROL_ECHO, 0, 3)})
-    a.sendRaw(b);
-  const float before = server.getWorldTimer().getAge();
-  for (auto [type, value] : {std::pair{CM::CONTROL_BANDWIDTH_REQUEST, 5000u}, {CM::CONTROL_WORLD_TIME_REQUEST, 0u},
-                             {CM::CONTROL_HEARTBEAT, 0u}, {CM::CONTROL_ECHO, 0u}})
-    a.send(type, value);
-  std::vector<Received> got;
-  for (auto [type, size] : {std::pair{CM::CONTROL_BANDWIDTH_GRANT, 8u}, {CM::CONTROL_WORLD_TIME, 8u},
-                            {CM::CONTROL_HEARTBEAT_REPLY, 4u}, {CM::CONTROL_ECHO_REPLY, 4u}}) {
-    auto r = a.next(2000, pump);
-    ASSERT_TRUE(r);
-    EXPECT_TRUE(r->type == type && r->size == size) << r->type << ", " << r->size << " bytes";
-    got.push_back(*r);
-  }
-  EXPECT_EQ(5000u, got[0].value);
-  const float world = ControlMessage{got[1].type, got[1].value}.floatValue();
-  EXPECT_GE(world, before);
-  EXPECT_LE(world, server.getWorldTimer().getAge());
-  EXPECT_EQ(5000u, client->getBandwidth());
-  EXPECT_EQ(N_Client::HEARTBEAT_IDLE, Access::state(*client));
-  EXPECT_TRUE(a.drain(200, pump).empty());
-}
-
 // The heartbeat machine is the client end's (its limits are tested there);
-// here: update() steps it from the pairing on, and latency is measured.
-TEST_F(ServerScriptedTest, HeartbeatsFromPairingOn) {
+// here: update() steps it from the pairing on, the control messages are
+// answered in order and the rest dropped, and latency is measured.
+TEST_F(ServerScriptedTest, ControlMessagesAndHeartbeatsFromPairingOn) {
   heartbeat(1.0f, 1.0f);
   N_Server server(port());
   ServerPump pump{server};
@@ -76,19 +41,42 @@ TEST_F(ServerScriptedTest, HeartbeatsFromPairingOn) {
   EXPECT_TRUE(a.drain(200, pump).empty());
   EXPECT_EQ(1, ServerAccess::clientCount(server));
 
-  // Our heartbeat first; the server answers and rests for its frequency,
-  // then sends its own, which we answer late.
   b.openData();
   b.openControl();
   N_Client* cb = pairUp(pump, b);
   ASSERT_NE(nullptr, cb);
+  EXPECT_EQ(N_Client::DEFAULT_BANDWIDTH, cb->getBandwidth());
+  // Not the server's, or too short: nothing comes back for these.
+  for (const Bytes& bytes : {controlBytes(0, 1), controlBytes(9, 2, 8), controlBytes(CM::CONTROL_BANDWIDTH_GRANT, 99),
+                             controlBytes(CM::CONTROL_ECHO_REPLY), controlBytes(CM::CONTROL_WORLD_TIME, CM::floatBits(3)),
+                             controlBytes(CM::CONTROL_BANDWIDTH_REQUEST, 77, 4),
+                             controlBytes(CM::CONTROL_BANDWIDTH_REQUEST, 78, 7), controlBytes(CM::CONTROL_ECHO, 0, 3)})
+    b.sendRaw(bytes);
+  // Our heartbeat among them; the server answers, rests for its frequency,
+  // then sends its own, which we answer late.
+  const float before = server.getWorldTimer().getAge();
   const Clock::time_point sent = Clock::now();  // before the server's rest starts
-  b.send(CM::CONTROL_HEARTBEAT);
-  auto reply = b.next(2000, pump);
+  for (auto [type, value] : {std::pair{CM::CONTROL_BANDWIDTH_REQUEST, 5000u}, {CM::CONTROL_WORLD_TIME_REQUEST, 0u},
+                             {CM::CONTROL_HEARTBEAT, 0u}, {CM::CONTROL_ECHO, 0u}})
+    b.send(type, value);
+  std::vector<Received> got;
+  for (auto [type, size] : {std::pair{CM::CONTROL_BANDWIDTH_GRANT, 8u}, {CM::CONTROL_WORLD_TIME, 8u},
+                            {CM::CONTROL_HEARTBEAT_REPLY, 4u}, {CM::CONTROL_ECHO_REPLY, 4u}}) {
+    auto r = b.next(2000, pump);
+    ASSERT_TRUE(r);
+    EXPECT_EQ(type, r->type);
+    EXPECT_EQ(size, r->size);
+    got.push_back(*r);
+  }
+  EXPECT_EQ(5000u, got[0].value);
+  const float world = ControlMessage{got[1].type, got[1].value}.floatValue();
+  EXPECT_GE(world, before);
+  EXPECT_LE(world, server.getWorldTimer().getAge());
+  EXPECT_EQ(5000u, cb->getBandwidth());
+  EXPECT_EQ(N_Client::HEARTBEAT_IDLE, Access::state(*cb));
   auto beat = b.next(3000, pump);
-  ASSERT_TRUE(reply && beat);
-  EXPECT_EQ(CM::CONTROL_HEARTBEAT_REPLY, reply->type);
-  EXPECT_EQ(CM::CONTROL_HEARTBEAT, beat->type);
+  ASSERT_TRUE(beat);
+  EXPECT_EQ(CM::CONTROL_HEARTBEAT, beat->type) << "nothing but the server's heartbeat after the answers";
   EXPECT_GE(secondsSince(sent), 0.95) << "the server rests for its frequency after answering";
   EXPECT_EQ(0.0f, cb->getLatency());
   pumpFor(60, pump);
