@@ -18,6 +18,9 @@ class ClientQueueTest : public ClientServerTest {
     N_Socket::ConnectData* data = nullptr;
     ASSERT_TRUE(waitFor([&] { return m_listener->pollConnect(data); }));
     m_peer = std::make_unique<N_Socket>(data);
+    // The accepted end looks its address up on a thread of its own, whose
+    // allocations would take the refusals that a test means for the client.
+    waitFor([&] { return m_peer->getAddress()->fullyResolved(); });
     ASSERT_TRUE(waitFor([&] { return Access::tcpSocket(*m_client)->isConnected(); }));
   }
   void TearDown() override {
