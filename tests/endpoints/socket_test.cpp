@@ -416,11 +416,10 @@ TEST_F(StreamTest, WithAndWithoutThePackage) {
 // body, several messages (empty ones too) in one read, and a long run of
 // mixed sizes cut at random. receive() and poll() see the same messages.
 TEST_F(StreamTest, ReadsCutAnywhereGiveTheSameMessages) {
-  const Bytes a = pattern(5, 1), b = pattern(10, 2), e, ab = concat({framed(a), framed(b)});
+  const Bytes a = pattern(5, 1), b = pattern(10, 2), e;
   struct Case { Bytes stream; std::vector<std::size_t> cuts; std::vector<Bytes> messages; };
-  std::vector<Case> cases = {{ab, {11, 13}, {a, b}}, {ab, {1, 4}, {a, b}}, {ab, {3, 6, 10}, {a, b}}, {ab, {2, 4, 9, 12, 14}, {a, b}},
-                             {concat({framed(e), framed(a), framed(e), framed(e), framed(b), framed(e), framed(a), framed(e), framed(e)}),
-                              {4, 17, 19, 21, 48, 48}, {e, a, e, e, b, e, a, e, e}}};
+  std::vector<Case> cases = {{concat({framed(e), framed(a), framed(e), framed(e), framed(b), framed(e), framed(a), framed(e), framed(e)}),
+                              {1, 4, 6, 8, 17, 19, 21, 26, 48, 48}, {e, a, e, e, b, e, a, e, e}}};
   std::mt19937 random(1234);
   Case& r = cases.emplace_back();
   for (unsigned i = 0; i < 300; ++i) {
