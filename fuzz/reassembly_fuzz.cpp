@@ -39,7 +39,11 @@ std::atomic<int> g_refusedBlocks{0};
 // Array allocations come from malloc, so that large ones can be refused; the
 // library counts a refused allocation as made, and the balance below knows.
 void* operator new[](std::size_t size, const std::nothrow_t&) noexcept {
-  return size > kLargestBlock ? (++g_refusedBlocks, nullptr) : std::malloc(size != 0 ? size : 1);
+  if (size > kLargestBlock) {
+    ++g_refusedBlocks;
+    return nullptr;
+  }
+  return std::malloc(size != 0 ? size : 1);
 }
 void* operator new[](std::size_t size) {
   if (void* p = std::malloc(size != 0 ? size : 1)) return p;
@@ -88,9 +92,13 @@ Expected reference(const unsigned char* stream, std::size_t size, std::uint32_t 
   while (size - at >= 4) {
     const std::uint32_t length =
         stream[at] | stream[at + 1] << 8 | stream[at + 2] << 16 | std::uint32_t{stream[at + 3]} << 24;
-    if (length > maximumLength) return e.broken = true, e;
+    if (length > maximumLength) {
+      e.broken = true;
+      return e;
+    }
     if (size - at - 4 < length) {
-      e.partialSize = std::int64_t(length) + 4, e.partialHave = static_cast<std::int64_t>(size - at);
+      e.partialSize = std::int64_t(length) + 4;
+      e.partialHave = static_cast<std::int64_t>(size - at);
       return e;
     }
     e.messages.emplace_back(stream + at + 4, stream + at + 4 + length);
@@ -120,7 +128,8 @@ void startOnce() {
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   startOnce();
-  const std::size_t k = size == 0 ? 0 : data[0] % 16, header = 1 + 2 * k;
+  if (size == 0) return 0;
+  const std::size_t k = data[0] % 16, header = 1 + 2 * k;
   if (size < header) return 0;
   // The largest length differs, and the open network's compact messages copy
   // short ones and grow long ones as they arrive.

@@ -60,9 +60,11 @@ TEST_F(SocketTest, FailedConstructionLeavesTheObjectUsable) {
     EXPECT_THROW(socket.construct(&unresolved, port(), type), N_NetException_IPNotResolved*);
     platform::fault::arm(call, {1, false, platform::WSAEADDRINUSE});
     EXPECT_THROW(socket.construct(loopback(), port(), type), N_NetException_LocalAddressAlreadyInUse*);
-    EXPECT_TRUE(!socket.isConnected() && registeredSockets() == 0);
+    EXPECT_FALSE(socket.isConnected());
+    EXPECT_EQ(0, registeredSockets());
   }
   socket.construct(loopback(), port(), N_Socket::SOCKET_UDP);
+  EXPECT_TRUE(socket.isConnected());
   EXPECT_THROW(send(socket, pattern(65508, 1)), N_NetException_PacketTooBig*);
   for (bool package : {false, true}) {
     if (package) socket.enablePackage();
@@ -92,17 +94,22 @@ TEST_F(SocketTest, ConnectAndDisconnectEvents) {
   const N_Socket* reported = nullptr;
   ASSERT_TRUE(waitFor([&] { return N_Socket::pollConnect(reported); }));
   EXPECT_EQ(&out, reported);
-  EXPECT_FALSE(N_Socket::pollConnect(reported) || in.connects > 0);
+  EXPECT_FALSE(N_Socket::pollConnect(reported));
+  EXPECT_EQ(0, in.connects.load());
   send(out, pattern(6, 1));
   ASSERT_TRUE(waitFor([&] { return out.getBytesWaitingForSend() == 0; }));
-  out.disconnect(), out.disconnect();
+  out.disconnect();
+  out.disconnect();
   EXPECT_FALSE(out.isConnected());
   ASSERT_TRUE(waitFor([&] { return !in.isConnected(); }));
   ASSERT_TRUE(nextMessage(in, pattern(6, 1)));  // the data in front of the close is still there
   in.disconnect();
   pumpFor(100, {});
-  EXPECT_TRUE(out.disconnects == 1 && in.disconnects == 1);
-  EXPECT_TRUE(nextDisconnect(0) == &out && nextDisconnect(0) == &in && nextDisconnect(0) == nullptr) << "oldest socket first";
+  EXPECT_EQ(1, out.disconnects.load());
+  EXPECT_EQ(1, in.disconnects.load());
+  EXPECT_EQ(&out, nextDisconnect(0));  // oldest socket first
+  EXPECT_EQ(&in, nextDisconnect(0));
+  EXPECT_EQ(nullptr, nextDisconnect(0));
 
   // A handler answering false raises no event; a connect not yet polled when
   // the disconnect comes shows only as the disconnect; a refused connect is silent.
@@ -113,7 +120,8 @@ TEST_F(SocketTest, ConnectAndDisconnectEvents) {
     ASSERT_TRUE(connectRaw(toRaw, fd));
     raw::closeFd(fd);
     ASSERT_TRUE(waitFor([&] { return toRaw.disconnects == 1; }));
-    EXPECT_TRUE(toRaw.connects == 1 && !N_Socket::pollConnect(reported));
+    EXPECT_EQ(1, toRaw.connects.load());
+    EXPECT_FALSE(N_Socket::pollConnect(reported));
     EXPECT_EQ(keep ? &toRaw : nullptr, nextDisconnect(keep ? 5000 : 100)) << keep;
   }
   FlagSocket refused;
@@ -166,10 +174,15 @@ TEST_F(SocketTest, ReceiveMayDestroyItsSocketPollOrThrow) {
     const int calls = BusySocket::calls;
     EXPECT_TRUE(mode != SLOW || BusySocket::finished == calls);
     pumpFor(50, {});
-    EXPECT_TRUE(BusySocket::calls == (mode == SLOW ? calls : all) && BusySocket::finished == calls);
-    EXPECT_TRUE(BusySocket::own == (mode == POLL ? 3 : 0) && BusySocket::traces == (mode == THROW ? 3 : 0));
+    EXPECT_EQ(mode == SLOW ? calls : all, BusySocket::calls.load());
+    EXPECT_EQ(calls, BusySocket::finished.load());
+    EXPECT_EQ(mode == POLL ? 3 : 0, BusySocket::own.load());
     EXPECT_EQ(mode == POLL || mode == THROW ? 1 : 0, registeredSockets());
-    for (unsigned i = 1; mode == THROW && i <= 3; ++i) EXPECT_TRUE(nextMessage(*in, pattern(4 + i, i)) && in->isConnected());
+    EXPECT_EQ(mode == THROW ? 3 : 0, BusySocket::traces.load());
+    if (mode == THROW) {
+      for (unsigned i = 1; i <= 3; ++i) EXPECT_TRUE(nextMessage(*in, pattern(4 + i, i)));
+      EXPECT_TRUE(in->isConnected());
+    }
     if (mode != DELETE) delete in;
     raw::closeFd(fd);
   }
@@ -196,7 +209,9 @@ TEST_F(SocketTest, DestroyedSocketLeavesOrphansThatTheNetworkSideFrees) {
     std::thread writer([&] { while (!stop && rawSend(fd, chunk)) {} });
     platform::Sleep(5 + round * 3);
     in.destruct();  // resets the connection: the writer's next send fails
-    stop = true, writer.join(), raw::reset(fd);
+    stop = true;
+    writer.join();
+    raw::reset(fd);
   }
   // WSASends still out (the peer doesn't read) are aborted by the close.
   N_Socket out;
@@ -229,21 +244,25 @@ TEST_F(SocketTest, ListenersQueueTheirConnectionsInOrder) {
   const int toA = raw::connectTo("127.0.0.1", port(), "127.0.0.3");
   const int toB2 = raw::connectTo("127.0.0.1", portB, "127.0.0.4");
   ASSERT_TRUE(waitFor([&] { return a.calls == 1 && b.calls == 2; }));
-  EXPECT_TRUE(a.queuedFirst == 1 && b.queuedFirst == 1);  // b's second entry waits behind its first
+  EXPECT_EQ(1, a.queuedFirst.load());
+  EXPECT_EQ(1, b.queuedFirst.load());  // b's second entry waits behind its first
   std::vector<std::unique_ptr<N_Socket>> accepted;
   struct Expected { CountingListener* listener; int fd; const char* from; };
   for (auto [listener, fd, from] : {Expected{&b, toB1, "127.0.0.2"}, Expected{&a, toA, "127.0.0.3"}, Expected{&b, toB2, "127.0.0.4"}}) {
     N_Socket::ConnectData* again = nullptr;
     ASSERT_TRUE(listener->pollConnect(entry) && listener->pollConnect(again));
-    EXPECT_TRUE(entry == again && entry->pListener == listener);
+    EXPECT_EQ(entry, again);
+    EXPECT_EQ(listener, entry->pListener);
     N_Socket& in = *accepted.emplace_back(std::make_unique<N_Socket>(entry));
-    EXPECT_TRUE(in.isConnected() && in.getSocketType() == N_Socket::SOCKET_TCP && in.getPort() == raw::localPort(fd));
+    EXPECT_TRUE(in.isConnected() && in.getSocketType() == N_Socket::SOCKET_TCP);
+    EXPECT_EQ(raw::localPort(fd), in.getPort());
     EXPECT_STREQ(from, const_cast<const char*>(in.getAddress()->getStringNumber()));
     raw::closeFd(fd);
   }
   EXPECT_FALSE(a.pollConnect(entry) || b.pollConnect(entry));
   b.construct(newPort);
-  EXPECT_TRUE(b.getPort() == newPort && portClosed(portB));
+  EXPECT_EQ(newPort, b.getPort());
+  EXPECT_TRUE(portClosed(portB));
   b.destruct();
   EXPECT_TRUE(portClosed(newPort));
   const int waiting = raw::connectTo("127.0.0.1", port());
@@ -261,7 +280,9 @@ TEST_F(SocketTest, AFullAcceptQueueWaitsForTheApplication) {
   limits.uMaximumAcceptQueue = 3;
   LimitsGuard guard(limits);
   N_Listener listener(port());
-  const auto descriptors = [] { return std::distance(std::filesystem::directory_iterator("/proc/self/fd"), {}); };
+  const auto descriptors = [] {
+    return std::distance(std::filesystem::directory_iterator("/proc/self/fd"), std::filesystem::directory_iterator{});
+  };
   const auto before = descriptors();
   std::vector<int> peers;
   for (int i = 0; i < 6; ++i) peers.push_back(raw::connectTo("127.0.0.1", port()));
@@ -272,7 +293,10 @@ TEST_F(SocketTest, AFullAcceptQueueWaitsForTheApplication) {
   N_Socket::ConnectData* entry = nullptr;
   while (refused < 6 && waitFor([&] { return listener.pollConnect(entry); })) refused += listener.rejectConnect(entry);
   EXPECT_EQ(6, refused);
-  for (int fd : peers) EXPECT_TRUE(raw::closedByPeer(fd, 5000)), raw::closeFd(fd);
+  for (int fd : peers) {
+    EXPECT_TRUE(raw::closedByPeer(fd, 5000));
+    raw::closeFd(fd);
+  }
 }
 
 // The network thread waits on at most 64 events by default: its release
@@ -305,10 +329,12 @@ TEST_P(WaitSetTest, SocketsFirstAndWhatDoesNotFitWaits) {
   addSockets(size - 3);
   const int portB = freePort();
   CountingListener first(port()), second(portB);
-  knock(port()), knock(portB);  // 1 + (size - 3) + 2 = size: all served
+  knock(port());  // 1 + (size - 3) + 2 = size: all served
+  knock(portB);
   EXPECT_TRUE(waitFor([&] { return first.calls == 1 && second.calls == 1; }));
   addSockets(1);  // the younger listener is out
-  knock(portB), knock(port());
+  knock(portB);
+  knock(port());
   EXPECT_TRUE(waitFor([&] { return first.calls == 2; }));
   EXPECT_TRUE(staysFalse([&] { return second.calls > 1; }, 300));
   addSockets(2);  // both listeners and the youngest socket are out
@@ -342,7 +368,9 @@ TEST_F(StreamTest, WithAndWithoutThePackage) {
   std::uint16_t p = 0;
   const int listening = raw::listenOn("127.0.0.1", p);
   N_Socket out(loopback(), p, N_Socket::SOCKET_TCP);
-  send(out, Bytes{'h', 'e', 'l', 'l', 'o'}), send(out, Bytes{'h', 'i'}), send(out, Bytes{});  // before the connect completes
+  send(out, Bytes{'h', 'e', 'l', 'l', 'o'});  // before the connect completes
+  send(out, Bytes{'h', 'i'});
+  send(out, Bytes{});
   const int fd = raw::acceptOne(listening, 5000);
   raw::closeFd(listening);
   EXPECT_EQ(Bytes({5, 0, 0, 0, 'h', 'e', 'l', 'l', 'o', 2, 0, 0, 0, 'h', 'i', 0, 0, 0, 0}), readWire(fd, 19));
@@ -359,13 +387,15 @@ TEST_F(StreamTest, WithAndWithoutThePackage) {
   out.disablePackage();  // bare bytes, up to the limit
   const unsigned s = static_cast<unsigned>(out.getMaximumSendPacketSize());
   EXPECT_EQ(65536u, s);
-  send(out, Bytes{1, 2, 3}), send(out, Bytes{});
+  send(out, Bytes{1, 2, 3});
+  send(out, Bytes{});
   const int waiting = out.getBytesWaitingForSend();
   EXPECT_THROW(send(out, pattern(s + 1, 2)), N_NetException_PacketTooBig*);
   EXPECT_LE(out.getBytesWaitingForSend(), waiting);
   send(out, pattern(s, 3));
   EXPECT_EQ(concat({Bytes{1, 2, 3}, pattern(s, 3)}), readWire(fd, s + 3));
-  out.enablePackage(), send(out, Bytes{9});
+  out.enablePackage();
+  send(out, Bytes{9});
   EXPECT_EQ(Bytes({1, 0, 0, 0, 9}), readWire(fd, 5));
 
   const Bytes stream = framed(pattern(100, 1));
@@ -449,7 +479,8 @@ TEST_F(StreamTest, AnEndOrBreakInsideAMessageEndsOnlyItsConnection) {
     SCOPED_TRACE(c.name);
     N_Socket bad, good;
     int badFd = -1, goodFd = -1;
-    ASSERT_TRUE(acceptRaw(listener, port(), bad, badFd) && acceptRaw(listener, port(), good, goodFd));
+    ASSERT_TRUE(acceptRaw(listener, port(), bad, badFd));
+    ASSERT_TRUE(acceptRaw(listener, port(), good, goodFd));
     raw::noDelay(badFd);
     write(badFd, concat({framed(a), framed(a), c.pieces[0]}));
     for (std::size_t i = 1; i < c.pieces.size(); ++i) write(badFd, c.pieces[i]);
@@ -459,12 +490,14 @@ TEST_F(StreamTest, AnEndOrBreakInsideAMessageEndsOnlyItsConnection) {
       c.reset ? raw::reset(badFd) : raw::closeFd(badFd);
       badFd = -1;
     }
-    EXPECT_TRUE(nextDisconnect() == &bad && (c.collecting >= 0 || bad.getReceivePacketSize() == 0));
+    EXPECT_EQ(&bad, nextDisconnect());
+    EXPECT_TRUE(c.collecting >= 0 || bad.getReceivePacketSize() == 0);
     for (int i = 0; i < 2; ++i) ASSERT_TRUE(nextMessage(bad, a));
     EXPECT_TRUE(noMessage(bad));
     write(goodFd, framed(a));
     ASSERT_TRUE(nextMessage(good, a));  // the other connection goes on
-    raw::closeFd(badFd), raw::closeFd(goodFd);
+    raw::closeFd(badFd);
+    raw::closeFd(goodFd);
     EXPECT_EQ(&good, nextDisconnect());
     EXPECT_EQ(nullptr, nextDisconnect(50)) << "the broken one's close reports nothing new";
   }

@@ -111,8 +111,8 @@ struct Connected {
 
   Connected() {
     EventLog accepting(listener, FD_ACCEPT);
-    EXPECT_TRUE(connectTo(client.socket, port) == SOCKET_ERROR && WSAGetLastError() == WSAEWOULDBLOCK)
-        << "a connect is always reported through FD_CONNECT";
+    EXPECT_EQ(SOCKET_ERROR, connectTo(client.socket, port));
+    EXPECT_EQ(WSAEWOULDBLOCK, WSAGetLastError()) << "a connect is always reported through FD_CONNECT";
     EXPECT_TRUE(accepting.await(FD_ACCEPT));
     server = std::make_unique<EventLog>(WSAAccept(listener, nullptr, nullptr, nullptr, 0), kAll);
     EXPECT_TRUE(client.await(FD_CONNECT | FD_WRITE));
@@ -130,22 +130,26 @@ TEST(Accept, AConditionFunctionRefuses) {
   Winsock ws;
   std::uint16_t port = 0;
   SOCKET listener = makeListener(port);
-  EventLog accepting(listener, FD_ACCEPT), client(tcpSocket(), kAll);
+  EventLog accepting(listener, FD_ACCEPT);
+  EventLog client(tcpSocket(), kAll);
   connectTo(client.socket, port);
   ASSERT_TRUE(accepting.await(FD_ACCEPT));
   const auto refuse = [](WSABUF* caller, WSABUF*, QOS*, QOS*, WSABUF*, WSABUF*, UINT*, std::uintptr_t) {
     return caller != nullptr && caller->len == sizeof(sockaddr_in) ? CF_REJECT : CF_ACCEPT;
   };
-  EXPECT_TRUE(WSAAccept(listener, nullptr, nullptr, refuse, 0) == INVALID_SOCKET && WSAGetLastError() == WSAECONNREFUSED);
+  EXPECT_EQ(INVALID_SOCKET, WSAAccept(listener, nullptr, nullptr, refuse, 0));
+  EXPECT_EQ(WSAECONNREFUSED, WSAGetLastError());
   EXPECT_TRUE(client.await(FD_CLOSE));
-  closesocket(client.socket), closesocket(listener);
+  closesocket(client.socket);
+  closesocket(listener);
 }
 
 // Connect and write come once; read comes again only after a read was
 // posted; an orderly close comes once, after the data in front of it was read.
 TEST(EventSelect, EachEventIsRecordedOnceUntilReEnabled) {
   Connected c;
-  EXPECT_TRUE(c.client.errors[FD_CONNECT_BIT] == 0 && (c.client.take() & (FD_CONNECT | FD_WRITE)) == 0);
+  EXPECT_EQ(0, c.client.errors[FD_CONNECT_BIT]);
+  EXPECT_EQ(0, c.client.take() & (FD_CONNECT | FD_WRITE));
   EXPECT_TRUE(c.server->await(FD_WRITE)) << "an accepted socket is writable";
   transfer(true, c.client.socket, "first", 5);
   ASSERT_TRUE(c.server->await(FD_READ));
@@ -162,18 +166,21 @@ TEST(EventSelect, EachEventIsRecordedOnceUntilReEnabled) {
   EXPECT_EQ(7u, transfer(false, c.server->socket, bytes, sizeof bytes).bytes);
   ASSERT_TRUE(c.server->await(FD_CLOSE));
   EXPECT_TRUE(c.server->quiet());
-  EXPECT_TRUE(c.server->errors[FD_CLOSE_BIT] == 0 && c.server->counts[FD_CLOSE_BIT] == 1);
+  EXPECT_EQ(0, c.server->errors[FD_CLOSE_BIT]);
+  EXPECT_EQ(1, c.server->counts[FD_CLOSE_BIT]);
 
   std::uint16_t port;
   closesocket(makeListener(port));
   EventLog refused(tcpSocket(), kAll);  // recorded with its error, and nothing else
-  EXPECT_TRUE(connectTo(refused.socket, port) == SOCKET_ERROR && WSAGetLastError() == WSAEWOULDBLOCK);
+  EXPECT_EQ(SOCKET_ERROR, connectTo(refused.socket, port));
+  EXPECT_EQ(WSAEWOULDBLOCK, WSAGetLastError());
   ASSERT_TRUE(refused.await(FD_CONNECT));
   EXPECT_EQ(WSAECONNREFUSED, refused.errors[FD_CONNECT_BIT]);
   EXPECT_TRUE(refused.quiet());
   EXPECT_EQ(FD_CONNECT, refused.seen | refused.take());
   Record never;
-  EXPECT_TRUE(post(true, refused.socket, "x", 1, never) == SOCKET_ERROR && WSAGetLastError() == WSAENOTCONN);
+  EXPECT_EQ(SOCKET_ERROR, post(true, refused.socket, "x", 1, never));
+  EXPECT_EQ(WSAENOTCONN, WSAGetLastError());
   closesocket(refused.socket);
 }
 
@@ -191,8 +198,12 @@ TEST(Overlapped, CompletionsRunInAlertableWaitsOfTheIssuingThread) {
   Sleep(50);
   EXPECT_EQ(0, g_finished.load()) << "a routine ran outside an alertable wait of this thread";
   ASSERT_TRUE(settles(sent) && settles(got));
-  EXPECT_TRUE(sent.bytes == 4 && got.error == 0 && got.bytes == 4 && std::memcmp(in, "ping", 4) == 0);
-  EXPECT_TRUE(sent.thread == std::this_thread::get_id() && got.thread == std::this_thread::get_id());
+  EXPECT_EQ(4u, sent.bytes);
+  EXPECT_EQ(0u, got.error);
+  EXPECT_EQ(4u, got.bytes);
+  EXPECT_EQ(0, std::memcmp(in, "ping", 4));
+  EXPECT_EQ(std::this_thread::get_id(), sent.thread);
+  EXPECT_EQ(std::this_thread::get_id(), got.thread);
   EXPECT_EQ(0u, SleepEx(30, TRUE)) << "each routine runs once";
 
   got = {};
@@ -201,7 +212,8 @@ TEST(Overlapped, CompletionsRunInAlertableWaitsOfTheIssuingThread) {
   ASSERT_EQ(SOCKET_ERROR, post(false, c.client.socket, in, sizeof in, atClient));
   ASSERT_EQ(0, WSASendDisconnect(c.client.socket, nullptr));
   ASSERT_TRUE(settles(got));
-  EXPECT_TRUE(got.error == 0 && got.bytes == 0) << got.error;
+  EXPECT_EQ(0u, got.error);
+  EXPECT_EQ(0u, got.bytes);
   ASSERT_EQ(0, closesocket(c.client.socket));
   ASSERT_TRUE(settles(atClient));
   EXPECT_EQ(static_cast<DWORD>(WSA_OPERATION_ABORTED), atClient.error);
@@ -214,13 +226,15 @@ TEST(Overlapped, CompletionsRunInAlertableWaitsOfTheIssuingThread) {
   connectTo(reset.socket, rawPort);
   const int peer = raw::acceptOne(listening, 5000);
   raw::closeFd(listening);
-  ASSERT_TRUE(peer >= 0 && reset.await(FD_CONNECT));
+  ASSERT_GE(peer, 0);
+  ASSERT_TRUE(reset.await(FD_CONNECT));
   got = {};
   ASSERT_EQ(SOCKET_ERROR, post(false, reset.socket, in, sizeof in, got));
   SleepEx(20, TRUE);  // the read waits for data
   raw::reset(peer);
   ASSERT_TRUE(settles(got));
-  EXPECT_TRUE(got.error == WSAECONNRESET && got.bytes == 0) << got.error;
+  EXPECT_EQ(static_cast<DWORD>(WSAECONNRESET), got.error);
+  EXPECT_EQ(0u, got.bytes);
   closesocket(reset.socket);
 }
 
@@ -238,8 +252,8 @@ TEST(Overlapped, ManySendsArriveIntactAndCompleteInOrder) {
   for (std::size_t i = 0, offset = 0; i < sizes.size(); offset += sizes[i++]) {
     if (i == 150) {
       fault::arm(Call::WSASend, {1, false, WSAEWOULDBLOCK});
-      EXPECT_TRUE(post(true, c.client.socket, payload.data() + offset, sizes[i], refused) == SOCKET_ERROR &&
-                  WSAGetLastError() == WSAEWOULDBLOCK);
+      EXPECT_EQ(SOCKET_ERROR, post(true, c.client.socket, payload.data() + offset, sizes[i], refused));
+      EXPECT_EQ(WSAEWOULDBLOCK, WSAGetLastError());
     }
     if (i % 50 == 49) fault::arm(Call::WSASend, {1, false, WSA_IO_PENDING});
     const int rc = post(true, c.client.socket, payload.data() + offset, sizes[i], sends[i]);
@@ -254,9 +268,11 @@ TEST(Overlapped, ManySendsArriveIntactAndCompleteInOrder) {
   }
   EXPECT_TRUE(received == payload);
   SleepEx(0, TRUE);
-  for (std::size_t i = 1; i < sends.size(); ++i)
-    ASSERT_TRUE(sends[i].error == 0 && sends[i].bytes == sizes[i] && sends[i - 1].order < sends[i].order)
-        << i << ": sends of one socket complete whole and in order";
+  for (std::size_t i = 1; i < sends.size(); ++i) {
+    ASSERT_EQ(0u, sends[i].error);
+    ASSERT_EQ(sizes[i], sends[i].bytes);
+    ASSERT_LT(sends[i - 1].order, sends[i].order) << "sends of one socket complete in order";
+  }
   EXPECT_EQ(-1, refused.order) << "a refused send never completes";
   c.client.seen = 0;
   EXPECT_TRUE(c.client.await(FD_WRITE)) << "a refused send arms FD_WRITE";
@@ -290,14 +306,18 @@ TEST(Wait, AnyOfThousandsGivesTheLowestSignalledIndex) {
   };
   for (DWORD i : {999u, 258u, 192u}) ASSERT_TRUE(WSASetEvent(e[i]));
   for (DWORD i : {192u, 258u, 999u}) {
-    EXPECT_TRUE(wait(e) == i && wait(e) == i) << "manual reset";
+    EXPECT_EQ(i, wait(e));
+    EXPECT_EQ(i, wait(e)) << "manual reset";
     ASSERT_TRUE(WSAResetEvent(e[i]));
   }
-  EXPECT_TRUE(wait(e, 20) == ~0u && result == WSA_WAIT_TIMEOUT);
+  EXPECT_EQ(~0u, wait(e, 20));
+  EXPECT_EQ(WSA_WAIT_TIMEOUT, result);
   ASSERT_TRUE(WSASetEvent(e[63]) && WSASetEvent(e[7]));  // Winsock's own wait, up to 64
   EXPECT_EQ(7u, WSAWaitForMultipleEvents(64, e.data(), FALSE, 0, TRUE));
-  for (DWORD count : {0u, 65u})
-    EXPECT_TRUE(WSAWaitForMultipleEvents(count, e.data(), FALSE, 0, TRUE) == WSA_WAIT_FAILED && WSAGetLastError() == WSA_INVALID_PARAMETER);
+  for (DWORD count : {0u, 65u}) {
+    EXPECT_EQ(WSA_WAIT_FAILED, WSAWaitForMultipleEvents(count, e.data(), FALSE, 0, TRUE));
+    EXPECT_EQ(WSA_INVALID_PARAMETER, WSAGetLastError());
+  }
   ASSERT_TRUE(WSAResetEvent(e[7]));
   EXPECT_EQ(63u, WSAWaitForMultipleEvents(64, e.data(), FALSE, 0, TRUE));
   ASSERT_TRUE(WSAResetEvent(e[63]));
@@ -310,8 +330,12 @@ TEST(Wait, AnyOfThousandsGivesTheLowestSignalledIndex) {
   std::thread([&] { WSASetEvent(e[640]); }).join();
   ASSERT_TRUE(WSACloseEvent(e[3]));
   EXPECT_FALSE(WSASetEvent(e[3]));
-  for (int again = 0; again < 2; ++again) EXPECT_TRUE(wait(e) == ~0u && WSAGetLastError() == WSA_INVALID_HANDLE);
-  EXPECT_TRUE(WSAWaitForMultipleEvents(4, e.data(), FALSE, 0, TRUE) == WSA_WAIT_FAILED && WSAGetLastError() == WSA_INVALID_HANDLE);
+  for (int again = 0; again < 2; ++again) {
+    EXPECT_EQ(~0u, wait(e));
+    EXPECT_EQ(WSA_INVALID_HANDLE, WSAGetLastError());
+  }
+  EXPECT_EQ(WSA_WAIT_FAILED, WSAWaitForMultipleEvents(4, e.data(), FALSE, 0, TRUE)) << "Winsock's wait too";
+  EXPECT_EQ(WSA_INVALID_HANDLE, WSAGetLastError());
   e[3] = WSACreateEvent();
   EXPECT_EQ(640u, wait(e));
   for (WSAEVENT h : e) WSACloseEvent(h);
@@ -321,7 +345,8 @@ TEST(Wait, AnyOfThousandsGivesTheLowestSignalledIndex) {
 // classic sequence per thread or on a state of its own; the local host can be
 // chosen, and lookups give per-thread records.
 TEST(System, MutexRandAndNames) {
-  HANDLE a = CreateMutexA(nullptr, FALSE, "system test mutex"), b = CreateMutexA(nullptr, FALSE, "system test mutex");
+  HANDLE a = CreateMutexA(nullptr, FALSE, "system test mutex");
+  HANDLE b = CreateMutexA(nullptr, FALSE, "system test mutex");
   HANDLE owned = CreateMutexA(nullptr, TRUE, "another name");
   ASSERT_EQ(WAIT_OBJECT_0, WaitForSingleObject(a, INFINITE));
   ASSERT_EQ(WAIT_OBJECT_0, WaitForSingleObject(b, 50)) << "the owner may take it again";
@@ -332,8 +357,12 @@ TEST(System, MutexRandAndNames) {
   }).join();
   EXPECT_TRUE(ReleaseMutex(a) && ReleaseMutex(b) && ReleaseMutex(owned));
   EXPECT_FALSE(ReleaseMutex(a)) << "released as often as taken";
-  EXPECT_TRUE(CloseHandle(a) && !CloseHandle(a));
-  std::thread([&] { EXPECT_EQ(WAIT_OBJECT_0, WaitForSingleObject(b, 0)) << "the other handle still works"; }).join();
+  EXPECT_TRUE(CloseHandle(a));
+  EXPECT_FALSE(CloseHandle(a));
+  std::thread([&] {
+    EXPECT_EQ(WAIT_OBJECT_0, WaitForSingleObject(b, 0)) << "the other handle still works";
+    EXPECT_TRUE(ReleaseMutex(b));
+  }).join();
   EXPECT_TRUE(CloseHandle(b) && CloseHandle(owned));
 
   platform::srand(1);
@@ -410,10 +439,11 @@ TEST(Faults, EveryCallFailsAsItsPlanSays) {
   for (const auto& [call, run] : calls) {
     SCOPED_TRACE(fault::name(call));
     FaultGuard faults(call, {.countdown = 2, .persist = false, .result = kCode});
-    const int first = run();
+    EXPECT_NE(kCode, run());
     WSASetLastError(0);  // the code must come from this failure, not an earlier one
-    const int second = run(), third = run();
-    EXPECT_TRUE(first != kCode && second == kCode && third != kCode && fault::fired(call) == 1) << first << " " << second;
+    EXPECT_EQ(kCode, run());
+    EXPECT_NE(kCode, run());
+    EXPECT_EQ(1, fault::fired(call));
   }
   for (SOCKET s : {listener, tcp}) closesocket(s);
   WSACloseEvent(event);
@@ -425,6 +455,7 @@ TEST(Faults, EveryCallFailsAsItsPlanSays) {
   faults.setCatalogue({});
   fault::disarmAll();
   EXPECT_EQ(0, WSAStartup(0x0002, &data));
-  EXPECT_TRUE(WSAEnumProtocolsA(nullptr, nullptr, &size) == SOCKET_ERROR && size > 0) << "the real catalogue is back";
+  EXPECT_EQ(SOCKET_ERROR, WSAEnumProtocolsA(nullptr, nullptr, &size));
+  EXPECT_GT(size, 0u) << "the real catalogue is back";
   WSACleanup();
 }
