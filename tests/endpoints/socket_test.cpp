@@ -443,39 +443,25 @@ TEST_F(StreamTest, ReadsCutAnywhereGiveTheSameMessages) {
   }
 }
 
-// A length up to the cap is collected; one above it breaks the stream, so
-// that even valid messages behind it are dropped.
-TEST_F(StreamTest, TheLargestLengthIsTheCap) {
-  for (const N_Limits& limits : {N_Limits::defaults(), N_Limits::openNetwork()}) {
-    LimitsGuard guard(limits);
-    for (std::uint32_t length : {limits.uMaximumMessageSize, limits.uMaximumMessageSize + 1}) {
-      for (std::size_t cut : {2, 4}) {  // inside the prefix or after it
-        SCOPED_TRACE(::testing::Message() << length << " cut at " << cut);
-        N_Socket in(loopback(), freePort(), N_Socket::SOCKET_TCP);
-        inject(in, concat({framed(pattern(8, 1)), slice(le32(length), 0, cut)}));
-        inject(in, concat({slice(le32(length), cut, 4), pattern(100, 2)}));
-        ASSERT_TRUE(nextMessage(in, pattern(8, 1), 0));
-        const bool broken = length > limits.uMaximumMessageSize;
-        EXPECT_EQ(broken ? 0 : static_cast<int>(length) + 4, in.getReceivePacketSize());
-        if (broken) inject(in, framed(pattern(3, 3)));
-        EXPECT_TRUE(!broken || noMessage(in, 0));
-      }
-    }
-  }
-}
-
-// A stream that ends inside a message (closed in a prefix, reset in a body)
-// or breaks on a length with the top bit set (whole or split) ends its own
+// A stream that ends inside a message (closed in a prefix, reset in a body,
+// closed in a message of the largest length) or breaks on a length above the
+// cap (by one, or with the top bit set; whole or split) ends its own
 // connection only: the messages in front stay pollable after the one
 // disconnect, and nothing behind shows, not even a valid message.
 TEST_F(StreamTest, AnEndOrBreakInsideAMessageEndsOnlyItsConnection) {
+  LimitsGuard open(N_Limits::openNetwork());
+  const std::uint32_t cap = N_Limits::openNetwork().uMaximumMessageSize;
+  const int atCap = static_cast<int>(cap) + 4;
   N_Listener listener(port());
-  const Bytes a = pattern(50, 1);
-  struct Case { const char* name; std::vector<Bytes> pieces; int collecting; bool reset; };
-  for (const Case& c : {Case{"closed in a prefix", {Bytes{3, 0}}, 0, false},
-                        Case{"reset in a body", {slice(framed(pattern(5000, 2)), 0, 1000)}, 5004, true},
-                        Case{"top bit", {concat({le32(0xFFFFFFFF), pattern(100, 3)}), framed(a)}, -1, false},
-                        Case{"top bit, split", {Bytes{0, 0}, concat({Bytes{0, 0x80}, pattern(100, 3)}), framed(a)}, -1, false}}) {
+  const Bytes a = pattern(50, 1), body = pattern(1000, 4);
+  struct Case { const char* name; std::vector<Bytes> pieces; int collecting; int missing; bool reset; };
+  for (const Case& c : {Case{"closed in a prefix", {Bytes{3, 0}}, 0, 0, false},
+                        Case{"reset in a body", {slice(framed(pattern(5000, 2)), 0, 1000)}, 5004, 4004, true},
+                        Case{"at the cap", {concat({le32(cap), body})}, atCap, atCap - 1004, false},
+                        Case{"at the cap, split", {slice(le32(cap), 0, 2), concat({slice(le32(cap), 2, 4), body})}, atCap, atCap - 1004, false},
+                        Case{"over the cap", {concat({le32(cap + 1), pattern(100, 3)}), framed(a)}, -1, 0, false},
+                        Case{"top bit", {concat({le32(0xFFFFFFFF), pattern(100, 3)}), framed(a)}, -1, 0, false},
+                        Case{"top bit, split", {Bytes{0, 0}, concat({Bytes{0, 0x80}, pattern(100, 3)}), framed(a)}, -1, 0, false}}) {
     SCOPED_TRACE(c.name);
     N_Socket bad, good;
     int badFd = -1, goodFd = -1;
@@ -486,7 +472,7 @@ TEST_F(StreamTest, AnEndOrBreakInsideAMessageEndsOnlyItsConnection) {
     for (std::size_t i = 1; i < c.pieces.size(); ++i) write(badFd, c.pieces[i]);
     if (c.collecting >= 0) {
       ASSERT_TRUE(waitFor([&] { return bad.getReceivePacketSize() == c.collecting && bad.getQueuedReceiveMessages() == 2; }));
-      EXPECT_EQ(c.collecting > 0 ? 4004 : 0, bad.getReceivePacketBytesMissing());
+      EXPECT_EQ(c.missing, bad.getReceivePacketBytesMissing());
       c.reset ? raw::reset(badFd) : raw::closeFd(badFd);
       badFd = -1;
     }
