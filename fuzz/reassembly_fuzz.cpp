@@ -13,8 +13,9 @@
 //
 // Checked: nothing reads or writes outside its blocks (the sanitizers), the
 // messages are exactly those a plain reference parser finds (ahead of the
-// first length that can't be true), the progress getters agree with it, and
-// every allocation is given back once the socket goes.
+// first length that can't be true), the stream breaks at such a length and
+// nowhere else but at a block that was refused, the progress getters agree
+// with the parser, and every allocation is given back once the socket goes.
 #include <algorithm>
 #include <atomic>
 #include <cstddef>
