@@ -218,24 +218,37 @@ TEST(Overlapped, CompletionsRunInAlertableWaitsOfTheIssuingThread) {
   ASSERT_TRUE(settles(atClient));
   EXPECT_EQ(static_cast<DWORD>(WSA_OPERATION_ABORTED), atClient.error);
 
-  // A reset by the peer fails a read under way with WSAECONNRESET: it is
-  // neither "try again" nor the orderly end of the stream.
+  // A reset by the peer fails a read with WSAECONNRESET, whether the read
+  // was under way or comes after: it is neither "try again" nor the orderly
+  // end of the stream.
   std::uint16_t rawPort = 0;
   const int listening = raw::listenOn("127.0.0.1", rawPort);
-  EventLog reset(tcpSocket(), FD_CONNECT);
-  connectTo(reset.socket, rawPort);
-  const int peer = raw::acceptOne(listening, 5000);
+  for (const bool readFirst : {true, false}) {
+    EventLog reset(tcpSocket(), FD_CONNECT);
+    connectTo(reset.socket, rawPort);
+    const int peer = raw::acceptOne(listening, 5000);
+    ASSERT_GE(peer, 0);
+    ASSERT_TRUE(reset.await(FD_CONNECT));
+    got = {};
+    if (readFirst) {
+      ASSERT_EQ(SOCKET_ERROR, post(false, reset.socket, in, sizeof in, got));
+      SleepEx(20, TRUE);  // the read waits for data
+      raw::reset(peer);
+    } else {
+      raw::reset(peer);
+      Sleep(50);
+      // Refused at once, or under way until the reset arrives.
+      if (post(false, reset.socket, in, sizeof in, got) == SOCKET_ERROR && WSAGetLastError() != WSA_IO_PENDING) {
+        got.error = static_cast<DWORD>(WSAGetLastError());
+        got.order = 0;
+      }
+    }
+    ASSERT_TRUE(settles(got)) << readFirst;
+    EXPECT_EQ(static_cast<DWORD>(WSAECONNRESET), got.error) << readFirst;
+    EXPECT_EQ(0u, got.bytes) << readFirst;
+    closesocket(reset.socket);
+  }
   raw::closeFd(listening);
-  ASSERT_GE(peer, 0);
-  ASSERT_TRUE(reset.await(FD_CONNECT));
-  got = {};
-  ASSERT_EQ(SOCKET_ERROR, post(false, reset.socket, in, sizeof in, got));
-  SleepEx(20, TRUE);  // the read waits for data
-  raw::reset(peer);
-  ASSERT_TRUE(settles(got));
-  EXPECT_EQ(static_cast<DWORD>(WSAECONNRESET), got.error);
-  EXPECT_EQ(0u, got.bytes);
-  closesocket(reset.socket);
 }
 
 // Sizes from 0 bytes to far beyond the socket buffers; some sends are made to
