@@ -47,14 +47,8 @@ TEST_F(ClientScriptedTest, OpeningSendsRequestWorldTimeAndHeartbeatInOrder) {
   // Set before any channel is up: it rules at once and goes out first.
   client.setBandwidth(4321);
   EXPECT_EQ(4321u, client.getBandwidth());
-  const Clock::time_point start = Clock::now();
+  // The world timer's exchanges are the next test's.
   ASSERT_TRUE(connect(client));
-  const double elapsed = secondsSince(start);
-  // Three exchanges answered: the server's 100 s plus half the mean round
-  // trip, which is below the time the connection took.
-  EXPECT_GE(client.getWorldTimer().getAge(), 100.0f);
-  EXPECT_LE(client.getWorldTimer().getAge(), 100.0 + elapsed + 0.05);
-
   ASSERT_TRUE(waitControl(script, 5, 3000, updating(client)));
   const std::vector<Received> got = script.control();
   // The heartbeat leaves from the first update nested in the wait.

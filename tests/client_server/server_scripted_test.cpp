@@ -17,34 +17,18 @@ class ServerScriptedTest : public ClientServerTest {
   }
 };
 
-// The heartbeat machine is the client end's (its limits are tested there);
-// here: update() steps it from the pairing on, the control messages are
-// answered in order and the rest dropped, and latency is measured.
+// The heartbeat machine and its limits are the client end's, which
+// update() steps from the pairing on; here: the control messages are answered
+// in order and the rest dropped, the server sends its own heartbeat, and
+// latency is measured.
 TEST_F(ServerScriptedTest, ControlMessagesAndHeartbeatsFromPairingOn) {
   heartbeat(1.0f, 1.0f);
   N_Server server(port());
   ServerPump pump{server};
-  ScriptedClient a(loopback(), port()), b(loopback(), port(), false, false);
-  N_Client* ca = pairUp(pump, a);
-  ASSERT_NE(nullptr, ca);
-  // Awaiting the peer from pairing: frequency plus latency.
-  EXPECT_EQ(N_Client::HEARTBEAT_AWAIT_PEER, Access::state(*ca));
-  Access::setHeartbeatAge(*ca, 1.9f);
-  server.update();
-  EXPECT_TRUE(ca->isConnected());
-  Access::setHeartbeatAge(*ca, 2.05f);
-  server.update();
-  EXPECT_FALSE(ca->isConnected());
-  EXPECT_TRUE(closed(a));
-  // A disconnected client reads nothing more, and stays listed until freed.
-  a.send(CM::CONTROL_ECHO);
-  EXPECT_TRUE(a.drain(200, pump).empty());
-  EXPECT_EQ(1, ServerAccess::clientCount(server));
-
-  b.openData();
-  b.openControl();
+  ScriptedClient b(loopback(), port());
   N_Client* cb = pairUp(pump, b);
   ASSERT_NE(nullptr, cb);
+  EXPECT_EQ(N_Client::HEARTBEAT_AWAIT_PEER, Access::state(*cb));
   EXPECT_EQ(N_Client::DEFAULT_BANDWIDTH, cb->getBandwidth());
   // Not the server's, or too short: nothing comes back for these.
   for (const Bytes& bytes : {controlBytes(0, 1), controlBytes(9, 2, 8), controlBytes(CM::CONTROL_BANDWIDTH_GRANT, 99),
@@ -84,7 +68,12 @@ TEST_F(ServerScriptedTest, ControlMessagesAndHeartbeatsFromPairingOn) {
   ASSERT_TRUE(waitFor([&] { return cb->getLatency() > 0.0f; }, 2000, pump));
   EXPECT_GE(cb->getLatency(), 0.06f);
   EXPECT_EQ(N_Client::HEARTBEAT_AWAIT_PEER, Access::state(*cb));
-  server.disconnectClient(ca);
+  // A disconnected client reads nothing more, and stays listed until freed.
+  cb->disconnect();
+  EXPECT_TRUE(closed(b));
+  b.send(CM::CONTROL_ECHO);
+  EXPECT_TRUE(b.drain(200, pump).empty());
+  EXPECT_EQ(1, ServerAccess::clientCount(server));
   server.disconnectClient(cb);
   EXPECT_EQ(0, ServerAccess::clientCount(server));
 }
@@ -274,61 +263,25 @@ class ServerLimitsTest : public ServerScriptedTest {
   }
 };
 
+// Connections that wait for their partner (plain sockets from addresses of
+// their own) take places, in all and per address; a newcomer takes the
+// oldest place of another address, and its control connection, which pairs
+// at once, takes none. A time limit, or the peer's close, frees them.
 TEST_F(ServerLimitsTest, UnpairedConnectionsAreBoundedAndReleased) {
-  for (bool perAddress : {true, false}) {
-    SCOPED_TRACE(perAddress ? "per address" : "in all");
-    auto bounded = std::make_unique<LimitsGuard>(limits(600.0f, perAddress ? 10 : 2, perAddress ? 2 : 0));
-    N_Server server(port());
-    ServerPump pump{server};
-    // Pairing goes by address, so all three here are data connections.
-    ScriptedClient a(loopback(), port(), true, false);
-    ASSERT_TRUE(waitFor([&] { return ServerAccess::clientCount(server) == 1; }, 5000, pump));
-    ScriptedClient b(loopback(), port(), true, false);
-    ASSERT_TRUE(waitFor([&] { return ServerAccess::clientCount(server) == 2; }, 5000, pump));
-    // The third is closed on arrival (its connect and the close may come in
-    // one pass of its end, so the close is what is waited for).
-    ScriptedClient c(loopback(), port(), true, false);
-    EXPECT_TRUE(waitFor(
-        [&] {
-          const N_Socket* gone = nullptr;
-          bool found = false;
-          while (N_Socket::pollDisconnect(gone)) found |= gone == c.data();
-          return found;
-        },
-        5000, pump));
-    EXPECT_EQ(2, ServerAccess::clientCount(server));
-    // With a short time limit the two go, and so does a lone control connection.
-    bounded.reset();
-    LimitsGuard brief(limits(0.2f, perAddress ? 10 : 2, perAddress ? 2 : 0));
-    EXPECT_TRUE(waitFor([&] { return ServerAccess::clientCount(server) == 0; }, 5000, pump));
-    EXPECT_TRUE(waitFor([&] { return !a.data()->isConnected() && !b.data()->isConnected(); }, 5000, pump));
-    ScriptedClient e(loopback(), port(), false, true);
-    ASSERT_TRUE(waitFor([&] { return ServerAccess::pendingControlCount(server) == 1; }, 5000, pump));
-    EXPECT_TRUE(waitFor([&] { return ServerAccess::pendingControlCount(server) == 0; }, 5000, pump));
-    EXPECT_TRUE(waitFor([&] { return !e.control()->isConnected(); }, 5000, pump));
-  }
-  // One whose peer closed goes at once, long before its time limit.
-  LimitsGuard guard(limits(600.0f));
+  LimitsGuard bounded(limits(600.0f, 2));
   N_Server server(port());
   ServerPump pump{server};
-  auto f = std::make_unique<ScriptedClient>(loopback(), port(), true, false);
-  ASSERT_TRUE(waitFor([&] { return ServerAccess::clientCount(server) == 1; }, 5000, pump));
-  f.reset();
-  EXPECT_TRUE(waitFor([&] { return ServerAccess::clientCount(server) == 0; }, 5000, pump));
-}
-
-// All places taken by other addresses: a newcomer takes the oldest one's
-// place, and its control connection, which pairs at once, takes none.
-TEST_F(ServerLimitsTest, ANewcomerTakesTheOldestWaitingPlace) {
-  LimitsGuard guard(limits(600.0f, 2));
-  N_Server server(port());
-  ServerPump pump{server};
-  int fds[2];
+  auto dataFrom = [&](const char* host) { return raw::connectTo("127.0.0.1", static_cast<std::uint16_t>(port()), host); };
+  auto closedByServer = [&](int fd) { return waitFor([&] { return raw::closedByPeer(fd, 0); }, 5000, pump); };
+  int fds[3];
   for (int i = 0; i < 2; ++i) {
-    fds[i] = raw::connectTo("127.0.0.1", static_cast<std::uint16_t>(port()), i == 0 ? "127.0.0.5" : "127.0.0.6");
+    fds[i] = dataFrom("127.0.0.5");
     ASSERT_GE(fds[i], 0);
     ASSERT_TRUE(waitFor([&] { return ServerAccess::clientCount(server) == i + 1; }, 5000, pump));
   }
+  // All places taken by its own address: closed on arrival.
+  fds[2] = dataFrom("127.0.0.5");
+  EXPECT_TRUE(closedByServer(fds[2]));
   ScriptedClient newcomer(loopback(), port());
   ASSERT_NE(nullptr, pairUp(pump, newcomer));
   EXPECT_TRUE(raw::closedByPeer(fds[0], 5000));
@@ -338,10 +291,22 @@ TEST_F(ServerLimitsTest, ANewcomerTakesTheOldestWaitingPlace) {
   LimitsGuard perAddress(limits(600.0f, 32, 2));
   int control[3];
   for (int& fd : control) fd = raw::connectTo("127.0.0.1", CM::CONTROL_PORT, "127.0.0.7");
-  EXPECT_TRUE(waitFor([&] { return raw::closedByPeer(control[2], 0); }, 5000, pump));
+  EXPECT_TRUE(closedByServer(control[2]));
   EXPECT_TRUE(
       staysFalse([&] { return raw::closedByPeer(control[0], 0) || raw::closedByPeer(control[1], 0); }, 300, pump));
   EXPECT_EQ(2, ServerAccess::pendingControlCount(server));
+  // One whose peer closed goes at once, long before its time limit.
+  const int gone = dataFrom("127.0.0.8");
+  ASSERT_TRUE(waitFor([&] { return ServerAccess::clientCount(server) == 3; }, 5000, pump));
+  raw::closeFd(gone);
+  EXPECT_TRUE(waitFor([&] { return ServerAccess::clientCount(server) == 2; }, 5000, pump));
+  // With a short time limit the waiting ones go, the paired one stays.
+  LimitsGuard brief(limits(0.2f, 32, 2));
+  EXPECT_TRUE(closedByServer(fds[1]));
+  EXPECT_TRUE(closedByServer(control[0]));
+  EXPECT_TRUE(closedByServer(control[1]));
+  EXPECT_EQ(1, ServerAccess::clientCount(server));
+  EXPECT_EQ(0, ServerAccess::pendingControlCount(server));
   for (int fd : fds) raw::closeFd(fd);
   for (int fd : control) raw::closeFd(fd);
 }
