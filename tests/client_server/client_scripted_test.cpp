@@ -56,8 +56,6 @@ TEST_F(ClientScriptedTest, OpeningSendsRequestWorldTimeAndHeartbeatInOrder) {
   EXPECT_TRUE(got[1].type == CM::CONTROL_WORLD_TIME_REQUEST && got[1].size == 4);
   EXPECT_TRUE(got[2].type == CM::CONTROL_HEARTBEAT && got[2].size == 4);
   EXPECT_EQ(3u, script.count(CM::CONTROL_WORLD_TIME_REQUEST));
-  ASSERT_TRUE(waitFor([&] { return client.getLatency() > 0.0f; }, 2000, updating(client)));
-  EXPECT_LT(client.getLatency(), 2.0f);
 
   // Requests follow the channel; a dead one stores the value and sends nothing.
   client.setBandwidth(999);

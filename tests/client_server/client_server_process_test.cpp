@@ -39,9 +39,9 @@ class ClientsTest : public ClientServerTest, public ::testing::WithParamInterfac
 };
 
 // Twenty clients, as many as the default wait set of 64 holds, and sixty in a
-// larger one: each handed out once with its own address, round trips
-// measured at both ends, reliable payloads answered in order and datagrams
-// carried, then all leave.
+// larger one: each handed out once with its own address, reliable payloads
+// answered in order and datagrams carried, then all leave. (Latency is the
+// scripted and statistics tests'.)
 TEST_P(ClientsTest, ExchangeAndLeave) {
   const int count = GetParam();
   N_Server server(port());
@@ -94,16 +94,6 @@ TEST_P(ClientsTest, ExchangeAndLeave) {
   for (int i = 0; i < count; ++i) {
     EXPECT_EQ(inOrder, reliable[clients[i]]) << peers[i]->host();
     EXPECT_TRUE(peers[i]->waitLine("e" + std::to_string(kPayloads - 1) + ";", 20000, serve)) << peers[i]->host();
-    // Measured, and within the latency the heartbeat allows (sixty
-    // processes under a sanitizer take more than a second to answer).
-    // Replies carry no number: one that comes after the next heartbeat left,
-    // from a server slower than the frequency, measures next to nothing, so
-    // only the upper bound is checked.
-    auto latency = peers[i]->waitLine("latency", 5000, serve);
-    ASSERT_TRUE(latency) << peers[i]->host();
-    EXPECT_LT(std::strtod(latency->c_str() + 8, nullptr), kLatency);  // "latency X"
-    EXPECT_TRUE(waitFor([&] { return clients[i]->getLatency() > 0.0f; }, 5000, serve));
-    EXPECT_LT(clients[i]->getLatency(), kLatency);
     datagrams += unreliable[clients[i]];
   }
   // Datagrams may be lost on a loaded machine, but the channel carries them.
