@@ -1,5 +1,8 @@
 #include "cs_fixture.h"
 
+#include <iterator>
+#include <sstream>
+
 namespace cs_test {
 
 Bytes controlBytes(std::uint32_t type, std::uint32_t value, int size) {
@@ -101,6 +104,26 @@ N_Client* PeerProcess::admit(const ServerPump& pump) {
   for (const std::string& line : m_process.lines()) said += "\n  " + line;
   ADD_FAILURE() << m_host << " did not connect; it said:" << said;
   return nullptr;
+}
+
+void echo(N_Client& client) try {
+  void* message = nullptr;
+  unsigned size = 0;
+  for (int i = 0; i < 256 && client.poll(message, size); ++i) try {
+      client.queueReliable(message, size, 0, 0);
+    } catch (N_NetException_PacketsStackingUp*) {
+      // The probes would show it if a good client lost one.
+    }
+  client.flushReliable();
+} catch (Q_Exception*) {
+}
+
+std::vector<double> probe(PeerProcess& peer, const std::string& command, const Pump& pump) {
+  peer.command("probe " + command);
+  std::istringstream in(peer.waitLine("probe-", 20000, pump).value_or(""));
+  std::string answer;
+  in >> answer;
+  return {std::istream_iterator<double>(in), {}};
 }
 
 }  // namespace cs_test

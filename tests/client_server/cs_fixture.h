@@ -136,4 +136,10 @@ class PeerProcess {
   ChildProcess m_process;
 };
 
+// Echoes every message, as many as a pass takes, for the probes of the
+// client hosts; a peer that doesn't read loses its echoes.
+void echo(N_Client& client);
+// Sends "probe <command>" to the host and gives the numbers of its answer.
+std::vector<double> probe(PeerProcess& peer, const std::string& command, const Pump& pump);
+
 }  // namespace cs_test

@@ -15,7 +15,6 @@
 #include <cerrno>
 #include <filesystem>
 #include <fstream>
-#include <iterator>
 #include <set>
 #include <sstream>
 
@@ -62,29 +61,6 @@ double msSince(Clock::time_point start) { return std::chrono::duration<double, s
 // Whether a line read from `p` so far starts with `prefix`.
 bool said(const ChildProcess& p, std::string_view prefix) {
   return std::ranges::any_of(p.lines(), [&](const std::string& line) { return line.starts_with(prefix); });
-}
-
-// Sends "probe <command>" and gives the numbers of the answer.
-std::vector<double> probe(PeerProcess& peer, const std::string& command, const Pump& pump) {
-  peer.command("probe " + command);
-  std::istringstream in(peer.waitLine("probe-", 20000, pump).value_or(""));
-  std::string answer;
-  in >> answer;
-  return {std::istream_iterator<double>(in), {}};
-}
-
-// Echoes every message, as many as a pass takes, for the probes.
-void echo(N_Client& client) try {
-  void* message = nullptr;
-  unsigned size = 0;
-  for (int i = 0; i < 256 && client.poll(message, size); ++i) try {
-      client.queueReliable(message, size, 0, 0);
-    } catch (N_NetException_PacketsStackingUp*) {
-      // A peer that doesn't read loses its echoes; the probes would show it
-      // if a good client did.
-    }
-  client.flushReliable();
-} catch (Q_Exception*) {
 }
 
 struct Attack {

@@ -68,15 +68,18 @@ struct Probe {
   std::vector<double> window;  // round trips (ms) since the last report
   Clock::time_point last, stoppedAt;
 
-  bool take(const std::string& text) {  // false if the batch holds no echoes
-    if (text.empty() || text[0] != '#') return false;
-    for (std::size_t at = 0, end; (end = text.find(';', at)) != std::string::npos; at = end + 1, ++echoed) {
+  // Takes the echoes among the payloads of a batch; false if it holds none.
+  bool take(const std::string& text) {
+    const std::size_t before = echoed;
+    for (std::size_t at = 0, end; (end = text.find(';', at)) != std::string::npos; at = end + 1) {
+      if (text[at] != '#') continue;
+      ++echoed;
       const std::size_t n = std::strtoul(text.c_str() + at + 1, nullptr, 10);
       disorder += n != expected;
       if (n < sentAt.size()) window.push_back(std::chrono::duration<double, std::milli>(Clock::now() - sentAt[n]).count());
       expected = n + 1;
     }
-    return true;
+    return echoed > before;
   }
   void step(N_Client& client) {
     const Clock::time_point now = Clock::now();
