@@ -17,12 +17,6 @@ std::string hostOf(const N_Client* client) {
   return number != nullptr ? const_cast<const char*>(number) : "";
 }
 
-static Received parse(const void* message, unsigned size) {
-  const auto* b = static_cast<const unsigned char*>(message);
-  auto word = [&](int at) { return b[at] | b[at + 1] << 8 | b[at + 2] << 16 | std::uint32_t{b[at + 3]} << 24; };
-  return {size, size >= 4 ? word(0) : 0, size >= 8 ? word(4) : 0};
-}
-
 void ClientServerTest::SetUp() {
   RuntimeTest::SetUp();
   heartbeat(0.2f, 0.2f);
@@ -46,7 +40,7 @@ std::optional<Received> ScriptedClient::next(int milliseconds, const Pump& pump)
   void* message = nullptr;
   unsigned size = 0;
   if (!waitFor([&] { return m_control->poll(message, size); }, milliseconds, pump)) return std::nullopt;
-  return parse(message, size);
+  return raw_peer::parse(message, size);
 }
 
 std::vector<Received> ScriptedClient::drain(int milliseconds, const Pump& pump) {

@@ -44,6 +44,11 @@ std::vector<char> controlMessage(std::uint32_t type, std::uint32_t value) {
 
 }  // namespace
 
+Received parse(const void* body, unsigned size) {
+  const auto* at = static_cast<const char*>(body);
+  return {size, size >= 4 ? word(at) : 0, size >= 8 ? word(at + 4) : 0};
+}
+
 RawPeer::RawPeer(const char* ip, const char* peerIp, std::uint16_t port) : m_start(std::chrono::steady_clock::now()) {
   std::uint16_t controlPort = kControlPort;
   m_dataListener = raw::listenOn(ip, port);
@@ -105,9 +110,7 @@ bool RawPeer::readStream(int fd, std::vector<char>& pending, Tally& tally, bool 
       const std::uint32_t length = word(pending.data());
       ++tally.messages;
       if (isControl) {
-        const Received& r = m_controlReceived.emplace_back(Received{
-            length, length >= 4 ? word(pending.data() + 4) : 0, length >= 8 ? word(pending.data() + 8) : 0});
-        types.push_back(r.type);
+        types.push_back(m_controlReceived.emplace_back(parse(pending.data() + 4, length)).type);
       }
       pending.erase(pending.begin(), pending.begin() + static_cast<std::ptrdiff_t>(4 + length));
     }

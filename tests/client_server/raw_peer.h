@@ -36,6 +36,9 @@ struct Received {
   std::uint32_t type, value;
 };
 
+// A control message's body as received: its size, type word and value word.
+Received parse(const void* body, unsigned size);
+
 class RawPeer {
  public:
   // Listens on ip:port and ip:6000, and exchanges datagrams between

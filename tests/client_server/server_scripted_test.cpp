@@ -1,6 +1,8 @@
 // The server end against client ends played by plain sockets in this process
 // (all on 127.0.0.1, paired one after the other), so that each control
 // message the server sends is seen as bytes.
+#include <algorithm>
+
 #include "cs_fixture.h"
 #include "raw_socket.h"
 #include "win32.h"
@@ -251,9 +253,6 @@ class ServerLimitsTest : public ServerScriptedTest {
     l.uMaximumUnpairedPerAddress = perAddress;
     return l;
   }
-  static unsigned count(const std::vector<Received>& got, std::uint32_t type) {
-    return static_cast<unsigned>(std::count_if(got.begin(), got.end(), [&](const Received& r) { return r.type == type; }));
-  }
 };
 
 // Connections that wait for their partner (plain sockets from addresses of
@@ -329,13 +328,13 @@ TEST_F(ServerLimitsTest, ControlWorkIsBudgetedAndRequestsCollected) {
   // The budget left the rest, the requests included, for the next update.
   EXPECT_EQ(36u * 4 + 5 * 8, unread());
   ASSERT_TRUE(waitFor([&] { return a.control()->getQueuedReceiveBytes() == 64 * 4; }));
-  EXPECT_EQ(64u, count(a.drain(100, {}), CM::CONTROL_ECHO_REPLY));
+  EXPECT_EQ(64, std::ranges::count(a.drain(100, {}), CM::CONTROL_ECHO_REPLY, &Received::type));
   server.update();
   EXPECT_EQ(0u, unread());
   ASSERT_TRUE(waitFor([&] { return a.control()->getQueuedReceiveBytes() == 36 * 4 + 8; }));
   const std::vector<Received> got = a.drain(100, {});
-  EXPECT_EQ(36u, count(got, CM::CONTROL_ECHO_REPLY));
-  ASSERT_EQ(1u, count(got, CM::CONTROL_BANDWIDTH_GRANT));
+  EXPECT_EQ(36, std::ranges::count(got, CM::CONTROL_ECHO_REPLY, &Received::type));
+  ASSERT_EQ(1, std::ranges::count(got, CM::CONTROL_BANDWIDTH_GRANT, &Received::type));
   EXPECT_EQ(5004u, got.back().value);
   EXPECT_EQ(5004u, ca->getBandwidth());
   EXPECT_TRUE(b.drain(200, pump).empty()) << "b's grant didn't change";
