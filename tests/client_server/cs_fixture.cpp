@@ -5,13 +5,6 @@
 
 namespace cs_test {
 
-Bytes controlBytes(std::uint32_t type, std::uint32_t value, int size) {
-  Bytes bytes(8);
-  for (int i = 0; i < 4; ++i) bytes[i] = (type >> (8 * i)) & 0xFF, bytes[4 + i] = (value >> (8 * i)) & 0xFF;
-  bytes.resize(size >= 0 ? static_cast<unsigned>(size) : CM::sizeOf(type));
-  return bytes;
-}
-
 std::string hostOf(const N_Client* client) {
   const volatile char* number = client->getAddress()->getStringNumber();
   return number != nullptr ? const_cast<const char*>(number) : "";

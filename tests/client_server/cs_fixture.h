@@ -53,9 +53,6 @@ using ServerAccess = N_ServerTestAccess;
 using Bytes = std::vector<unsigned char>;
 
 inline void sleepMs(int milliseconds) { std::this_thread::sleep_for(std::chrono::milliseconds(milliseconds)); }
-// A control message as raw bytes, little-endian, cut to `size` when asked
-// (the value word is there even for 4-byte types, so a cut one carries known bytes).
-Bytes controlBytes(std::uint32_t type, std::uint32_t value = 0, int size = -1);
 std::string hostOf(const N_Client* client);
 
 // Heartbeats at 0.2 s / 0.2 s and the simulation off unless a test says
@@ -70,6 +67,7 @@ class ClientServerTest : public RuntimeTest {
   }
 };
 
+using raw_peer::controlBytes;
 using raw_peer::Received;
 using raw_peer::RawPeer;
 

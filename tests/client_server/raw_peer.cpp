@@ -35,14 +35,16 @@ std::vector<char> framed(const std::vector<char>& body) {
   return out;
 }
 
-std::vector<char> controlMessage(std::uint32_t type, std::uint32_t value) {
+}  // namespace
+
+std::vector<unsigned char> controlBytes(std::uint32_t type, std::uint32_t value, int size) {
   std::vector<char> body;
   putWord(body, type);
-  if (type == 1 || type == 2 || type == kWorldTime) putWord(body, value);
-  return framed(body);
+  putWord(body, value);
+  const bool valued = type == 1 || type == 2 || type == kWorldTime;
+  body.resize(size >= 0 ? static_cast<std::size_t>(size) : valued ? 8 : 4);
+  return {body.begin(), body.end()};
 }
-
-}  // namespace
 
 Received parse(const void* body, unsigned size) {
   const auto* at = static_cast<const char*>(body);
@@ -148,10 +150,6 @@ void RawPeer::sendReliable(std::size_t size, char fill) {
 
 void RawPeer::sendUnreliable(std::size_t size, char fill) {
   send(m_udp, std::vector<char>(size, fill), m_sent.unreliable);
-}
-
-void RawPeer::sendControl(std::uint32_t type, std::uint32_t value) {
-  send(m_control, controlMessage(type, value), m_sent.control);
 }
 
 void RawPeer::sendControlBytes(const std::vector<unsigned char>& body) {
