@@ -49,8 +49,7 @@ TEST_P(ClientsTest, ExchangeAndLeave) {
   std::vector<std::unique_ptr<PeerProcess>> peers;
   std::vector<N_Client*> clients;
   for (int i = 0; i < count; ++i) {
-    peers.push_back(std::make_unique<PeerProcess>(
-        2 + i, port(), std::vector<std::string>{"--hb-frequency", "1", "--hb-latency", "5"}));
+    peers.push_back(std::make_unique<PeerProcess>(2 + i, port()));
     clients.push_back(peers.back()->admit(pump));
     ASSERT_NE(nullptr, clients.back()) << peers.back()->host();
   }

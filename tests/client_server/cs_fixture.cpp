@@ -58,11 +58,11 @@ N_Client* pairUp(const ServerPump& pump, ScriptedClient& client) {
   return nullptr;
 }
 
-PeerProcess::PeerProcess(int hostNumber, int port, std::vector<std::string> extra)
-    : m_host("127.0.0." + std::to_string(hostNumber)), m_process(VARDEL_HOST_CLIENT_PEER, [&] {
-        extra.insert(extra.begin(), {"--host", m_host, "--server", "127.0.0.1", "--port", std::to_string(port)});
-        return extra;
-      }()) {}
+PeerProcess::PeerProcess(int hostNumber, int port)
+    : m_host("127.0.0." + std::to_string(hostNumber)),
+      m_process(VARDEL_HOST_CLIENT_PEER, {"--host", m_host, "--server", "127.0.0.1", "--port", std::to_string(port),
+                                          "--hb-frequency", std::to_string(N_Client::getHeartbeatFrequency()),
+                                          "--hb-latency", std::to_string(N_Client::getHeartbeatLatency())}) {}
 
 std::optional<std::string> PeerProcess::waitLine(const std::string& text, int milliseconds, const Pump& pump) {
   for (const auto deadline = Clock::now() + std::chrono::milliseconds(milliseconds); Clock::now() < deadline;) {

@@ -117,10 +117,11 @@ class ServerPump {
 // A scripted client that the server has paired and handed out.
 N_Client* pairUp(const ServerPump& pump, ScriptedClient& client);
 
-// One client host process (tests/hosts/client_peer.cpp) on 127.0.0.<n>.
+// One client host process (tests/hosts/client_peer.cpp) on 127.0.0.<n>,
+// with the heartbeat settings of this process.
 class PeerProcess {
  public:
-  PeerProcess(int hostNumber, int port, std::vector<std::string> extra = {});
+  PeerProcess(int hostNumber, int port);
   const std::string& host() const { return m_host; }
   // Reads lines until one contains `text`, pumping meanwhile.
   std::optional<std::string> waitLine(const std::string& text, int milliseconds, const Pump& pump = {});

@@ -104,8 +104,7 @@ void HostileTest::run(const Attack& a) {
     if (msSince(lastSample) > 5) lastSample = Clock::now(), peakRss = std::max(peakRss, rssBytes());
   };
   auto join = [&](int host) {  // starts probing once admitted
-    const std::vector<std::string> options = {"--hb-frequency", "0.5", "--hb-latency", "4"};
-    peers.push_back(std::make_unique<PeerProcess>(host, port(), options));
+    peers.push_back(std::make_unique<PeerProcess>(host, port()));
     return peers.back()->admit(serve) != nullptr && peers.back()->command("probe 20");
   };
   for (int host : {2, 3}) ASSERT_TRUE(join(host));

@@ -59,8 +59,7 @@ TEST_F(NetworkModelTest, TwoConnectionsFollowTheDrawsAndTheCap) {
   heartbeat(1.0f, 5.0f);  // a loaded machine may hold a peer for a second
   N_Server server(port());
   ServerPump pump(server);
-  const std::vector<std::string> options = {"--hb-frequency", "1", "--hb-latency", "5"};
-  PeerProcess a(2, port(), options), b(3, port(), options);
+  PeerProcess a(2, port()), b(3, port());
   PeerProcess* peers[2] = {&a, &b};
   N_Client* clients[2] = {a.admit(pump), b.admit(pump)};
   ASSERT_TRUE(clients[0] != nullptr && clients[1] != nullptr);
