@@ -27,9 +27,8 @@ class ClientsTest : public ClientServerTest, public ::testing::WithParamInterfac
     // Twenty or sixty processes starting one by one, each spinning through
     // its world clock exchange, can hold a core for a second on a loaded
     // machine: a heartbeat may take that long without meaning a dead peer.
-    heartbeat(1.0f, kLatency);
+    heartbeat(1.0f, 5.0f);
   }
-  static constexpr float kLatency = 5.0f;
   void TearDown() override {
     ClientServerTest::TearDown();
     N_Initializer::setMaximumWaitEvents(64);
