@@ -23,10 +23,10 @@ void ClientServerTest::TearDown() {
   RuntimeTest::TearDown();
 }
 
-ScriptedClient::ScriptedClient(const N_Address* server, int port, bool openDataNow, bool openControlNow)
+ScriptedClient::ScriptedClient(const N_Address* server, int port, bool openDataNow)
     : m_pServer(server), m_iPort(port) {
   if (openDataNow) openData();
-  if (openControlNow) openControl();
+  m_control.emplace(m_pServer, CM::CONTROL_PORT, N_Socket::SOCKET_TCP);
 }
 
 std::optional<Received> ScriptedClient::next(int milliseconds, const Pump& pump) {

@@ -72,12 +72,11 @@ using raw_peer::Received;
 using raw_peer::RawPeer;
 
 // The client end played by plain sockets on the test thread: a data
-// connection to `port` and a control connection to 6000.
+// connection to `port` (later, if asked) and a control connection to 6000.
 class ScriptedClient {
  public:
-  ScriptedClient(const N_Address* server, int port, bool openDataNow = true, bool openControlNow = true);
+  ScriptedClient(const N_Address* server, int port, bool openDataNow = true);
   void openData() { m_data.emplace(m_pServer, m_iPort, N_Socket::SOCKET_TCP); }
-  void openControl() { m_control.emplace(m_pServer, CM::CONTROL_PORT, N_Socket::SOCKET_TCP); }
   bool connected() { return m_data && m_data->isConnected() && m_control && m_control->isConnected(); }
   bool closed() { return !m_data->isConnected() && !m_control->isConnected(); }
   void send(std::uint32_t type, std::uint32_t value = 0) { sendRaw(controlBytes(type, value)); }

@@ -157,7 +157,7 @@ TEST_F(ServerScriptedTest, ClientsAreHandedOutOnceAfterPairingAndGoWithDestruct)
   ASSERT_NE(nullptr, pairUp(pump, first));
   // Control first, then data (the first client, of the same address, has its
   // control channel already); data first is how every other test pairs.
-  ScriptedClient controlFirst(loopback(), port(), false, true);
+  ScriptedClient controlFirst(loopback(), port(), false);
   ASSERT_TRUE(waitFor([&] { return ServerAccess::pendingControlCount(server) == 1; }, 5000, pump));
   pumpFor(200, pump);
   EXPECT_EQ(1u, pump.announced().size());
@@ -311,11 +311,10 @@ TEST_F(ServerLimitsTest, ControlWorkIsBudgetedAndRequestsCollected) {
   LimitsGuard guard(N_Limits::openNetwork());
   N_Server server(port());
   ServerPump pump{server};
-  ScriptedClient a(loopback(), port()), b(loopback(), port(), false, false);
+  ScriptedClient a(loopback(), port());
   N_Client* ca = pairUp(pump, a);
   ASSERT_NE(nullptr, ca);
-  b.openData();
-  b.openControl();
+  ScriptedClient b(loopback(), port());
   ASSERT_NE(nullptr, pairUp(pump, b));
   b.send(CM::CONTROL_BANDWIDTH_REQUEST, 10240);
   EXPECT_EQ(10240u, b.lastGrant(pump));
