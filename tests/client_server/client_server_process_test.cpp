@@ -4,7 +4,6 @@
 #include <set>
 
 #include "cs_fixture.h"
-#include "win32.h"
 
 using namespace cs_test;
 
