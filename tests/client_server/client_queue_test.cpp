@@ -318,4 +318,32 @@ TEST_F(ClientQueueTest, TheNetworkModelTimesAMessageFromTheReadThatTookItIn) {
   EXPECT_EQ("late", std::string(static_cast<const char*>(m), n));
 }
 
+// Another model leaves what the last one holds held and starts the
+// statistics again; switched off, the model hands it out at once, in its
+// order and ahead of what comes later.
+TEST_F(ClientQueueTest, ASwitchedOffModelHandsOutWhatItHolds) {
+  N_Client::simulateNetwork({.fDelay = 5000});
+  void* m = nullptr;
+  unsigned n = 0;
+  auto read = [&] { return client().poll(m, n) ? std::string(static_cast<const char*>(m), n) : "<none>"; };
+  for (const char* h : {"h0", "h1", "h2"}) peerSends(h);
+  ASSERT_TRUE(waitFor([&] { return read() == "<none>" && client().getSimulationStats().uReceived == 3; }));
+  const unsigned held = client().getSimulationStats().uQueuedBytes;
+  EXPECT_GT(held, 0u);
+  N_Client::simulateNetwork({.fDelay = 1000});
+  EXPECT_EQ("<none>", read()) << "still held";
+  N_SimulationStats s = client().getSimulationStats();
+  EXPECT_EQ(0u, s.uReceived);
+  EXPECT_EQ(held, s.uQueuedBytes);
+  EXPECT_EQ(held, s.uPeakQueuedBytes);
+  N_Client::simulateNetwork(N_NetworkModel{});
+  peerSends("k");
+  ASSERT_TRUE(waitFor([&] { return client().getStatistics().reliable.uMessagesReceived == 4; }));
+  for (const char* expected : {"h0", "h1", "h2", "k"}) EXPECT_EQ(expected, read());
+  s = client().getSimulationStats();
+  EXPECT_EQ(0u, s.uReceived);
+  EXPECT_EQ(3u, s.uDelivered);
+  EXPECT_EQ(0u, s.uQueuedBytes);
+}
+
 }  // namespace

@@ -47,14 +47,8 @@ TEST_F(ClientScriptedTest, OpeningSendsRequestWorldTimeAndHeartbeatInOrder) {
   // Set before any channel is up: it rules at once and goes out first.
   client.setBandwidth(4321);
   EXPECT_EQ(4321u, client.getBandwidth());
-  const Clock::time_point start = Clock::now();
+  // The world timer's exchanges are the next test's.
   ASSERT_TRUE(connect(client));
-  const double elapsed = secondsSince(start);
-  // Three exchanges answered: the server's 100 s plus half the mean round
-  // trip, which is below the time the connection took.
-  EXPECT_GE(client.getWorldTimer().getAge(), 100.0f);
-  EXPECT_LE(client.getWorldTimer().getAge(), 100.0 + elapsed + 0.05);
-
   ASSERT_TRUE(waitControl(script, 5, 3000, updating(client)));
   const std::vector<Received> got = script.control();
   // The heartbeat leaves from the first update nested in the wait.
@@ -62,8 +56,6 @@ TEST_F(ClientScriptedTest, OpeningSendsRequestWorldTimeAndHeartbeatInOrder) {
   EXPECT_TRUE(got[1].type == CM::CONTROL_WORLD_TIME_REQUEST && got[1].size == 4);
   EXPECT_TRUE(got[2].type == CM::CONTROL_HEARTBEAT && got[2].size == 4);
   EXPECT_EQ(3u, script.count(CM::CONTROL_WORLD_TIME_REQUEST));
-  ASSERT_TRUE(waitFor([&] { return client.getLatency() > 0.0f; }, 2000, updating(client)));
-  EXPECT_LT(client.getLatency(), 2.0f);
 
   // Requests follow the channel; a dead one stores the value and sends nothing.
   client.setBandwidth(999);
@@ -267,7 +259,6 @@ TEST_F(ClientScriptedTest, WithoutAServerOrAnAddress) {
   EXPECT_LT(secondsSince(start), 0.5);
   EXPECT_EQ(port(), client.getPort());
   EXPECT_EQ(loopback()->getIdentifier(), client.getAddress()->getIdentifier());
-  EXPECT_GT(client.getLargestUnreliablePacketSize(), 0u);
 
   // An empty object answers empty, before and after a life.
   N_Client empty;

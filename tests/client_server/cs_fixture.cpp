@@ -1,23 +1,13 @@
 #include "cs_fixture.h"
 
-namespace cs_test {
+#include <iterator>
+#include <sstream>
 
-Bytes controlBytes(std::uint32_t type, std::uint32_t value, int size) {
-  Bytes bytes(8);
-  for (int i = 0; i < 4; ++i) bytes[i] = (type >> (8 * i)) & 0xFF, bytes[4 + i] = (value >> (8 * i)) & 0xFF;
-  bytes.resize(size >= 0 ? static_cast<unsigned>(size) : CM::sizeOf(type));
-  return bytes;
-}
+namespace cs_test {
 
 std::string hostOf(const N_Client* client) {
   const volatile char* number = client->getAddress()->getStringNumber();
   return number != nullptr ? const_cast<const char*>(number) : "";
-}
-
-static Received parse(const void* message, unsigned size) {
-  const auto* b = static_cast<const unsigned char*>(message);
-  auto word = [&](int at) { return b[at] | b[at + 1] << 8 | b[at + 2] << 16 | std::uint32_t{b[at + 3]} << 24; };
-  return {size, size >= 4 ? word(0) : 0, size >= 8 ? word(4) : 0};
 }
 
 void ClientServerTest::SetUp() {
@@ -33,17 +23,17 @@ void ClientServerTest::TearDown() {
   RuntimeTest::TearDown();
 }
 
-ScriptedClient::ScriptedClient(const N_Address* server, int port, bool openDataNow, bool openControlNow)
+ScriptedClient::ScriptedClient(const N_Address* server, int port, bool openDataNow)
     : m_pServer(server), m_iPort(port) {
   if (openDataNow) openData();
-  if (openControlNow) openControl();
+  m_control.emplace(m_pServer, CM::CONTROL_PORT, N_Socket::SOCKET_TCP);
 }
 
 std::optional<Received> ScriptedClient::next(int milliseconds, const Pump& pump) {
   void* message = nullptr;
   unsigned size = 0;
   if (!waitFor([&] { return m_control->poll(message, size); }, milliseconds, pump)) return std::nullopt;
-  return parse(message, size);
+  return raw_peer::parse(message, size);
 }
 
 std::vector<Received> ScriptedClient::drain(int milliseconds, const Pump& pump) {
@@ -68,11 +58,11 @@ N_Client* pairUp(const ServerPump& pump, ScriptedClient& client) {
   return nullptr;
 }
 
-PeerProcess::PeerProcess(int hostNumber, int port, std::vector<std::string> extra)
-    : m_host("127.0.0." + std::to_string(hostNumber)), m_process(VARDEL_HOST_CLIENT_PEER, [&] {
-        extra.insert(extra.begin(), {"--host", m_host, "--server", "127.0.0.1", "--port", std::to_string(port)});
-        return extra;
-      }()) {}
+PeerProcess::PeerProcess(int hostNumber, int port)
+    : m_host("127.0.0." + std::to_string(hostNumber)),
+      m_process(VARDEL_HOST_CLIENT_PEER, {"--host", m_host, "--server", "127.0.0.1", "--port", std::to_string(port),
+                                          "--hb-frequency", std::to_string(N_Client::getHeartbeatFrequency()),
+                                          "--hb-latency", std::to_string(N_Client::getHeartbeatLatency())}) {}
 
 std::optional<std::string> PeerProcess::waitLine(const std::string& text, int milliseconds, const Pump& pump) {
   for (const auto deadline = Clock::now() + std::chrono::milliseconds(milliseconds); Clock::now() < deadline;) {
@@ -101,6 +91,26 @@ N_Client* PeerProcess::admit(const ServerPump& pump) {
   for (const std::string& line : m_process.lines()) said += "\n  " + line;
   ADD_FAILURE() << m_host << " did not connect; it said:" << said;
   return nullptr;
+}
+
+void echo(N_Client& client) try {
+  void* message = nullptr;
+  unsigned size = 0;
+  for (int i = 0; i < 256 && client.poll(message, size); ++i) try {
+      client.queueReliable(message, size, 0, 0);
+    } catch (N_NetException_PacketsStackingUp*) {
+      // The probes would show it if a good client lost one.
+    }
+  client.flushReliable();
+} catch (Q_Exception*) {
+}
+
+std::vector<double> probe(PeerProcess& peer, const std::string& command, const Pump& pump) {
+  peer.command("probe " + command);
+  std::istringstream in(peer.waitLine("probe-", 20000, pump).value_or(""));
+  std::string answer;
+  in >> answer;
+  return {std::istream_iterator<double>(in), {}};
 }
 
 }  // namespace cs_test

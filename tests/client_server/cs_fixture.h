@@ -53,9 +53,6 @@ using ServerAccess = N_ServerTestAccess;
 using Bytes = std::vector<unsigned char>;
 
 inline void sleepMs(int milliseconds) { std::this_thread::sleep_for(std::chrono::milliseconds(milliseconds)); }
-// A control message as raw bytes, little-endian, cut to `size` when asked
-// (the value word is there even for 4-byte types, so a cut one carries known bytes).
-Bytes controlBytes(std::uint32_t type, std::uint32_t value = 0, int size = -1);
 std::string hostOf(const N_Client* client);
 
 // Heartbeats at 0.2 s / 0.2 s and the simulation off unless a test says
@@ -70,16 +67,16 @@ class ClientServerTest : public RuntimeTest {
   }
 };
 
+using raw_peer::controlBytes;
 using raw_peer::Received;
 using raw_peer::RawPeer;
 
 // The client end played by plain sockets on the test thread: a data
-// connection to `port` and a control connection to 6000.
+// connection to `port` (later, if asked) and a control connection to 6000.
 class ScriptedClient {
  public:
-  ScriptedClient(const N_Address* server, int port, bool openDataNow = true, bool openControlNow = true);
+  ScriptedClient(const N_Address* server, int port, bool openDataNow = true);
   void openData() { m_data.emplace(m_pServer, m_iPort, N_Socket::SOCKET_TCP); }
-  void openControl() { m_control.emplace(m_pServer, CM::CONTROL_PORT, N_Socket::SOCKET_TCP); }
   bool connected() { return m_data && m_data->isConnected() && m_control && m_control->isConnected(); }
   bool closed() { return !m_data->isConnected() && !m_control->isConnected(); }
   void send(std::uint32_t type, std::uint32_t value = 0) { sendRaw(controlBytes(type, value)); }
@@ -119,10 +116,11 @@ class ServerPump {
 // A scripted client that the server has paired and handed out.
 N_Client* pairUp(const ServerPump& pump, ScriptedClient& client);
 
-// One client host process (tests/hosts/client_peer.cpp) on 127.0.0.<n>.
+// One client host process (tests/hosts/client_peer.cpp) on 127.0.0.<n>,
+// with the heartbeat settings of this process.
 class PeerProcess {
  public:
-  PeerProcess(int hostNumber, int port, std::vector<std::string> extra = {});
+  PeerProcess(int hostNumber, int port);
   const std::string& host() const { return m_host; }
   // Reads lines until one contains `text`, pumping meanwhile.
   std::optional<std::string> waitLine(const std::string& text, int milliseconds, const Pump& pump = {});
@@ -135,5 +133,11 @@ class PeerProcess {
   std::string m_host;
   ChildProcess m_process;
 };
+
+// Echoes every message, as many as a pass takes, for the probes of the
+// client hosts; a peer that doesn't read loses its echoes.
+void echo(N_Client& client);
+// Sends "probe <command>" to the host and gives the numbers of its answer.
+std::vector<double> probe(PeerProcess& peer, const std::string& command, const Pump& pump);
 
 }  // namespace cs_test

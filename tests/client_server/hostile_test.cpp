@@ -15,9 +15,7 @@
 #include <cerrno>
 #include <filesystem>
 #include <fstream>
-#include <iterator>
 #include <set>
-#include <sstream>
 
 #include "N_Limits.h"
 #include "cs_fixture.h"
@@ -64,29 +62,6 @@ bool said(const ChildProcess& p, std::string_view prefix) {
   return std::ranges::any_of(p.lines(), [&](const std::string& line) { return line.starts_with(prefix); });
 }
 
-// Sends "probe <command>" and gives the numbers of the answer.
-std::vector<double> probe(PeerProcess& peer, const std::string& command, const Pump& pump) {
-  peer.command("probe " + command);
-  std::istringstream in(peer.waitLine("probe-", 20000, pump).value_or(""));
-  std::string answer;
-  in >> answer;
-  return {std::istream_iterator<double>(in), {}};
-}
-
-// Echoes every message, as many as a pass takes, for the probes.
-void echo(N_Client& client) try {
-  void* message = nullptr;
-  unsigned size = 0;
-  for (int i = 0; i < 256 && client.poll(message, size); ++i) try {
-      client.queueReliable(message, size, 0, 0);
-    } catch (N_NetException_PacketsStackingUp*) {
-      // A peer that doesn't read loses its echoes; the probes would show it
-      // if a good client did.
-    }
-  client.flushReliable();
-} catch (Q_Exception*) {
-}
-
 struct Attack {
   const char* name;
   double seconds;
@@ -128,8 +103,7 @@ void HostileTest::run(const Attack& a) {
     if (msSince(lastSample) > 5) lastSample = Clock::now(), peakRss = std::max(peakRss, rssBytes());
   };
   auto join = [&](int host) {  // starts probing once admitted
-    const std::vector<std::string> options = {"--hb-frequency", "0.5", "--hb-latency", "4"};
-    peers.push_back(std::make_unique<PeerProcess>(host, port(), options));
+    peers.push_back(std::make_unique<PeerProcess>(host, port()));
     return peers.back()->admit(serve) != nullptr && peers.back()->command("probe 20");
   };
   for (int host : {2, 3}) ASSERT_TRUE(join(host));

@@ -35,14 +35,21 @@ std::vector<char> framed(const std::vector<char>& body) {
   return out;
 }
 
-std::vector<char> controlMessage(std::uint32_t type, std::uint32_t value) {
+}  // namespace
+
+std::vector<unsigned char> controlBytes(std::uint32_t type, std::uint32_t value, int size) {
   std::vector<char> body;
   putWord(body, type);
-  if (type == 1 || type == 2 || type == kWorldTime) putWord(body, value);
-  return framed(body);
+  putWord(body, value);
+  const bool valued = type == 1 || type == 2 || type == kWorldTime;
+  body.resize(size >= 0 ? static_cast<std::size_t>(size) : valued ? 8 : 4);
+  return {body.begin(), body.end()};
 }
 
-}  // namespace
+Received parse(const void* body, unsigned size) {
+  const auto* at = static_cast<const char*>(body);
+  return {size, size >= 4 ? word(at) : 0, size >= 8 ? word(at + 4) : 0};
+}
 
 RawPeer::RawPeer(const char* ip, const char* peerIp, std::uint16_t port) : m_start(std::chrono::steady_clock::now()) {
   std::uint16_t controlPort = kControlPort;
@@ -105,9 +112,7 @@ bool RawPeer::readStream(int fd, std::vector<char>& pending, Tally& tally, bool 
       const std::uint32_t length = word(pending.data());
       ++tally.messages;
       if (isControl) {
-        const Received& r = m_controlReceived.emplace_back(Received{
-            length, length >= 4 ? word(pending.data() + 4) : 0, length >= 8 ? word(pending.data() + 8) : 0});
-        types.push_back(r.type);
+        types.push_back(m_controlReceived.emplace_back(parse(pending.data() + 4, length)).type);
       }
       pending.erase(pending.begin(), pending.begin() + static_cast<std::ptrdiff_t>(4 + length));
     }
@@ -145,10 +150,6 @@ void RawPeer::sendReliable(std::size_t size, char fill) {
 
 void RawPeer::sendUnreliable(std::size_t size, char fill) {
   send(m_udp, std::vector<char>(size, fill), m_sent.unreliable);
-}
-
-void RawPeer::sendControl(std::uint32_t type, std::uint32_t value) {
-  send(m_control, controlMessage(type, value), m_sent.control);
 }
 
 void RawPeer::sendControlBytes(const std::vector<unsigned char>& body) {

@@ -36,6 +36,13 @@ struct Received {
   std::uint32_t type, value;
 };
 
+// A control message's body: the type word, and the value word for types 1,
+// 2 and 8; cut to `size` when asked (the value word is there even for 4-byte
+// types, so a cut one carries known bytes).
+std::vector<unsigned char> controlBytes(std::uint32_t type, std::uint32_t value = 0, int size = -1);
+// A control message's body as received: its size, type word and value word.
+Received parse(const void* body, unsigned size);
+
 class RawPeer {
  public:
   // Listens on ip:port and ip:6000, and exchanges datagrams between
@@ -48,8 +55,7 @@ class RawPeer {
   // One packaged message of `size` bytes of `fill` on the data stream.
   void sendReliable(std::size_t size, char fill);
   void sendUnreliable(std::size_t size, char fill);
-  // A control message: the type word, and the value word for types 1, 2, 8.
-  void sendControl(std::uint32_t type, std::uint32_t value = 0);
+  void sendControl(std::uint32_t type, std::uint32_t value = 0) { sendControlBytes(controlBytes(type, value)); }
   void sendControlBytes(const std::vector<unsigned char>& body);  // packaged as given, cut ones too
 
   Direction sent();
