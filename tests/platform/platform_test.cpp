@@ -468,6 +468,10 @@ TEST(Faults, EveryCallFailsAsItsPlanSays) {
   faults.setCatalogue({});
   fault::disarmAll();
   EXPECT_EQ(0, WSAStartup(0x0002, &data));
+  // Any major version from 1 on is agreed; 0 is not a version.
+  EXPECT_EQ(WSAVERNOTSUPPORTED, WSAStartup(0x0100, &data));
+  EXPECT_EQ(0, WSAStartup(0x0101, &data));
+  WSACleanup();
   EXPECT_EQ(SOCKET_ERROR, WSAEnumProtocolsA(nullptr, nullptr, &size));
   EXPECT_GT(size, 0u) << "the real catalogue is back";
   WSACleanup();
