@@ -13,8 +13,9 @@
 //
 // Checked: nothing reads or writes outside its blocks (the sanitizers), the
 // messages are exactly those a plain reference parser finds (ahead of the
-// first length that can't be true), the progress getters agree with it, and
-// every allocation is given back once the socket goes.
+// first length that can't be true), the stream breaks at such a length and
+// nowhere else but at a block that was refused, the progress getters agree
+// with the parser, and every allocation is given back once the socket goes.
 #include <algorithm>
 #include <atomic>
 #include <cstddef>
@@ -46,9 +47,8 @@ void* operator new[](std::size_t size, const std::nothrow_t&) noexcept {
   return std::malloc(size != 0 ? size : 1);
 }
 void* operator new[](std::size_t size) {
-  void* p = std::malloc(size != 0 ? size : 1);
-  if (p == nullptr) throw std::bad_alloc();
-  return p;
+  if (void* p = std::malloc(size != 0 ? size : 1)) return p;
+  throw std::bad_alloc();
 }
 void operator delete[](void* p) noexcept { std::free(p); }
 void operator delete[](void* p, std::size_t) noexcept { std::free(p); }
@@ -73,9 +73,8 @@ class FuzzSocket : public N_Socket {
     const auto* p = static_cast<const unsigned char*>(data);
     if (size > 0 && p == nullptr) std::abort();
     received.emplace_back(p, p + size);
-    if (received.size() % 2 == 0) return false;
-    kept.push_back(received.size() - 1);
-    return true;
+    if (received.size() % 2 == 1) kept.push_back(received.size() - 1);
+    return received.size() % 2 == 1;
   }
   std::vector<Bytes> received;
   std::vector<std::size_t> kept;
@@ -109,14 +108,13 @@ Expected reference(const unsigned char* stream, std::size_t size, std::uint32_t 
   return e;
 }
 
-N_Initializer* g_network = nullptr;
 N_Address* g_loopback = nullptr;
 int g_port = 0;
 
 void startOnce() {
-  if (g_network != nullptr) return;
+  if (g_loopback != nullptr) return;
   platform::setLocalHost("127.0.0.1");
-  g_network = new N_Initializer;
+  new N_Initializer;  // up for the whole run
   g_loopback = new N_Address("127.0.0.1");
   // Its reverse lookup allocates on a thread of its own: let it finish, so
   // that the allocation balance below counts this target's work alone.
@@ -133,11 +131,11 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   startOnce();
   if (size == 0) return 0;
   const std::size_t k = data[0] % 16, header = 1 + 2 * k;
+  if (size < header) return 0;
   // The largest length differs, and the open network's compact messages copy
   // short ones and grow long ones as they arrive.
   N_Initializer::setLimits((data[0] & 16) != 0 ? N_Limits::openNetwork() : N_Limits::defaults());
   const std::uint32_t maximumLength = N_Initializer::getLimits().uMaximumMessageSize;
-  if (size < header) return 0;
   std::vector<std::size_t> cuts;
   for (std::size_t i = 0; i < k; ++i) cuts.push_back(std::size_t(data[1 + 2 * i] | data[2 + 2 * i] << 8) + 1);
   if (cuts.empty()) cuts.push_back(65536);
@@ -160,25 +158,24 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
 
     const Expected e = reference(stream, streamSize, maximumLength);
     const bool broken = N_SocketTestAccess::streamBroken(socket);
-    // A length that can't be true breaks the stream; so may a block that
+    // A length that can't be true breaks the stream; so does a block that
     // can't be allocated, but only at a message that can't finish here.
-    if (e.broken && !broken) std::abort();
-    if (broken && !e.broken && e.partialSize == 0) std::abort();
+    const bool refusedHere = g_refusedBlocks.load() != refusedBefore;
+    if (broken != e.broken && !(broken && refusedHere && e.partialSize > 0)) std::abort();
     if (socket.received != e.messages) std::abort();
     const bool whole = !broken && e.partialHave >= 4;  // a prefix read in full
     if (socket.getReceivePacketSize() != (whole ? e.partialSize : 0)) std::abort();
     if (!broken && socket.getReceivePacketBytesMissing() != (whole ? e.partialSize - e.partialHave : 0)) std::abort();
     // The kept messages come out of poll() whole and in order.
+    void* message = nullptr;
+    unsigned int messageSize = 0;
     for (std::size_t index : socket.kept) {
-      void* message = nullptr;
-      unsigned int messageSize = 0;
-      if (!socket.poll(message, messageSize)) std::abort();
       const Bytes& want = socket.received[index];
-      if (messageSize != want.size() || (messageSize > 0 && std::memcmp(message, want.data(), messageSize) != 0))
+      if (!socket.poll(message, messageSize) || messageSize != want.size() ||
+          (messageSize > 0 && std::memcmp(message, want.data(), messageSize) != 0))
         std::abort();
     }
-    void* none;
-    if (unsigned int noneSize; socket.poll(none, noneSize)) std::abort();
+    if (socket.poll(message, messageSize)) std::abort();
   }
   const int refused = g_refusedBlocks.load() - refusedBefore;
   if (Q_Memory::sm_iNewCount.load() - newBefore - refused != Q_Memory::sm_iDeleteCount.load() - deleteBefore)

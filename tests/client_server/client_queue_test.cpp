@@ -18,6 +18,9 @@ class ClientQueueTest : public ClientServerTest {
     N_Socket::ConnectData* data = nullptr;
     ASSERT_TRUE(waitFor([&] { return m_listener->pollConnect(data); }));
     m_peer = std::make_unique<N_Socket>(data);
+    // The accepted end looks its address up on a thread of its own, whose
+    // allocations would take the refusals that a test means for the client.
+    waitFor([&] { return m_peer->getAddress()->fullyResolved(); });
     ASSERT_TRUE(waitFor([&] { return Access::tcpSocket(*m_client)->isConnected(); }));
   }
   void TearDown() override {
@@ -232,7 +235,7 @@ TEST_F(ClientQueueTest, QueuesIgnoreTheStateOfTheChannel) {
 // Reading with the simulated delay: each read with the delay on, a message or
 // not, draws the next gate from the thread's generator; a shut gate holds
 // messages and draws nothing. Loss is for the unreliable channel only (the
-// process test checks it): it leaves reliable messages alone.
+// statistics test checks it): it leaves reliable messages alone.
 TEST_F(ClientQueueTest, ReadingWithTheSimulatedDelay) {
   void* m = nullptr;
   unsigned n = 0;
@@ -297,6 +300,50 @@ TEST_F(ClientQueueTest, ReadingWithTheSimulatedDelay) {
     EXPECT_EQ("<none>", read());
     expectGate(first, before, minimum, maximum);
   }
+}
+
+// Under the network model a reliable message is timed from the read that
+// took it from the socket, however long it waited there before.
+TEST_F(ClientQueueTest, TheNetworkModelTimesAMessageFromTheReadThatTookItIn) {
+  N_Client::simulateNetwork({.fDelay = 1000});
+  void* m = nullptr;
+  unsigned n = 0;
+  EXPECT_FALSE(client().poll(m, n));
+  peerSends("late");
+  ASSERT_TRUE(waitFor([&] { return client().getStatistics().reliable.uMessagesReceived == 1; }));
+  sleepMs(1500);  // longer than the delay since the read before
+  EXPECT_FALSE(client().poll(m, n)) << "read at once";
+  EXPECT_EQ(1u, client().getSimulationStats().uReceived);
+  ASSERT_TRUE(waitFor([&] { return client().poll(m, n); }, 5000));
+  EXPECT_EQ("late", std::string(static_cast<const char*>(m), n));
+}
+
+// Another model leaves what the last one holds held and starts the
+// statistics again; switched off, the model hands it out at once, in its
+// order and ahead of what comes later.
+TEST_F(ClientQueueTest, ASwitchedOffModelHandsOutWhatItHolds) {
+  N_Client::simulateNetwork({.fDelay = 5000});
+  void* m = nullptr;
+  unsigned n = 0;
+  auto read = [&] { return client().poll(m, n) ? std::string(static_cast<const char*>(m), n) : "<none>"; };
+  for (const char* h : {"h0", "h1", "h2"}) peerSends(h);
+  ASSERT_TRUE(waitFor([&] { return read() == "<none>" && client().getSimulationStats().uReceived == 3; }));
+  const unsigned held = client().getSimulationStats().uQueuedBytes;
+  EXPECT_GT(held, 0u);
+  N_Client::simulateNetwork({.fDelay = 1000});
+  EXPECT_EQ("<none>", read()) << "still held";
+  N_SimulationStats s = client().getSimulationStats();
+  EXPECT_EQ(0u, s.uReceived);
+  EXPECT_EQ(held, s.uQueuedBytes);
+  EXPECT_EQ(held, s.uPeakQueuedBytes);
+  N_Client::simulateNetwork(N_NetworkModel{});
+  peerSends("k");
+  ASSERT_TRUE(waitFor([&] { return client().getStatistics().reliable.uMessagesReceived == 4; }));
+  for (const char* expected : {"h0", "h1", "h2", "k"}) EXPECT_EQ(expected, read());
+  s = client().getSimulationStats();
+  EXPECT_EQ(0u, s.uReceived);
+  EXPECT_EQ(3u, s.uDelivered);
+  EXPECT_EQ(0u, s.uQueuedBytes);
 }
 
 }  // namespace

@@ -1,25 +1,13 @@
 #include "cs_fixture.h"
 
-#include <cstdlib>
+#include <iterator>
+#include <sstream>
 
 namespace cs_test {
-
-Bytes controlBytes(std::uint32_t type, std::uint32_t value, int size) {
-  Bytes bytes(8);
-  for (int i = 0; i < 4; ++i) bytes[i] = (type >> (8 * i)) & 0xFF, bytes[4 + i] = (value >> (8 * i)) & 0xFF;
-  bytes.resize(size >= 0 ? static_cast<unsigned>(size) : CM::sizeOf(type));
-  return bytes;
-}
 
 std::string hostOf(const N_Client* client) {
   const volatile char* number = client->getAddress()->getStringNumber();
   return number != nullptr ? const_cast<const char*>(number) : "";
-}
-
-static Received parse(const void* message, unsigned size) {
-  const auto* b = static_cast<const unsigned char*>(message);
-  auto word = [&](int at) { return b[at] | b[at + 1] << 8 | b[at + 2] << 16 | std::uint32_t{b[at + 3]} << 24; };
-  return {size, size >= 4 ? word(0) : 0, size >= 8 ? word(4) : 0};
 }
 
 void ClientServerTest::SetUp() {
@@ -35,70 +23,17 @@ void ClientServerTest::TearDown() {
   RuntimeTest::TearDown();
 }
 
-ScriptedServer::ScriptedServer(int port) : m_dataListener(port), m_controlListener(CM::CONTROL_PORT) {
-  m_thread = std::thread([this] {
-    for (; !m_bStop; std::this_thread::sleep_for(std::chrono::microseconds(200))) {
-      std::lock_guard<std::mutex> hold(m_lock);
-      N_Socket::ConnectData* entry = nullptr;
-      if (!m_data && m_dataListener.pollConnect(entry)) m_data = std::make_unique<N_Socket>(entry);
-      if (!m_control && m_controlListener.pollConnect(entry)) m_control = std::make_unique<N_Socket>(entry);
-      void* message = nullptr;
-      unsigned size = 0;
-      while (m_control && m_control->poll(message, size)) {
-        const Received& r = m_received.emplace_back(parse(message, size));
-        Bytes reply;
-        if (r.type == CM::CONTROL_HEARTBEAT && answerHeartbeats) reply = controlBytes(CM::CONTROL_HEARTBEAT_REPLY);
-        if (r.type == CM::CONTROL_WORLD_TIME_REQUEST && worldTimeAnswers != 0) {
-          if (worldTimeAnswers > 0) --worldTimeAnswers;
-          reply = controlBytes(CM::CONTROL_WORLD_TIME, CM::floatBits(worldTimeValue.load()));
-        }
-        if (!reply.empty()) m_control->send(reply.data(), static_cast<unsigned>(reply.size()));
-      }
-    }
-  });
-}
-
-ScriptedServer::~ScriptedServer() {
-  m_bStop = true;
-  m_thread.join();
-}
-
-std::vector<Received> ScriptedServer::control() {
-  std::lock_guard<std::mutex> hold(m_lock);
-  return m_received;
-}
-
-std::size_t ScriptedServer::count(std::uint32_t type) {
-  const std::vector<Received> all = control();
-  return std::count_if(all.begin(), all.end(), [&](const Received& r) { return r.type == type; });
-}
-
-bool ScriptedServer::connected(bool control) {
-  std::lock_guard<std::mutex> hold(m_lock);
-  const std::unique_ptr<N_Socket>& s = control ? m_control : m_data;
-  return s && s->isConnected();
-}
-
-void ScriptedServer::sendControl(const Bytes& bytes) {
-  std::lock_guard<std::mutex> hold(m_lock);
-  if (m_control) m_control->send(const_cast<unsigned char*>(bytes.data()), static_cast<unsigned>(bytes.size()));
-}
-
-bool ScriptedServer::waitControl(std::size_t count, int milliseconds, const Pump& pump) {
-  return waitFor([&] { return control().size() >= count; }, milliseconds, pump);
-}
-
-ScriptedClient::ScriptedClient(const N_Address* server, int port, bool openDataNow, bool openControlNow)
+ScriptedClient::ScriptedClient(const N_Address* server, int port, bool openDataNow)
     : m_pServer(server), m_iPort(port) {
   if (openDataNow) openData();
-  if (openControlNow) openControl();
+  m_control.emplace(m_pServer, CM::CONTROL_PORT, N_Socket::SOCKET_TCP);
 }
 
 std::optional<Received> ScriptedClient::next(int milliseconds, const Pump& pump) {
   void* message = nullptr;
   unsigned size = 0;
   if (!waitFor([&] { return m_control->poll(message, size); }, milliseconds, pump)) return std::nullopt;
-  return parse(message, size);
+  return raw_peer::parse(message, size);
 }
 
 std::vector<Received> ScriptedClient::drain(int milliseconds, const Pump& pump) {
@@ -123,11 +58,11 @@ N_Client* pairUp(const ServerPump& pump, ScriptedClient& client) {
   return nullptr;
 }
 
-PeerProcess::PeerProcess(int hostNumber, int port, std::vector<std::string> extra)
-    : m_host("127.0.0." + std::to_string(hostNumber)), m_process(VARDEL_HOST_CLIENT_PEER, [&] {
-        extra.insert(extra.begin(), {"--host", m_host, "--server", "127.0.0.1", "--port", std::to_string(port)});
-        return extra;
-      }()) {}
+PeerProcess::PeerProcess(int hostNumber, int port)
+    : m_host("127.0.0." + std::to_string(hostNumber)),
+      m_process(VARDEL_HOST_CLIENT_PEER, {"--host", m_host, "--server", "127.0.0.1", "--port", std::to_string(port),
+                                          "--hb-frequency", std::to_string(N_Client::getHeartbeatFrequency()),
+                                          "--hb-latency", std::to_string(N_Client::getHeartbeatLatency())}) {}
 
 std::optional<std::string> PeerProcess::waitLine(const std::string& text, int milliseconds, const Pump& pump) {
   for (const auto deadline = Clock::now() + std::chrono::milliseconds(milliseconds); Clock::now() < deadline;) {
@@ -158,9 +93,24 @@ N_Client* PeerProcess::admit(const ServerPump& pump) {
   return nullptr;
 }
 
-double valueOf(const std::string& line) {
-  const std::size_t space = line.find(' ');
-  return space == std::string::npos ? 0.0 : std::strtod(line.c_str() + space + 1, nullptr);
+void echo(N_Client& client) try {
+  void* message = nullptr;
+  unsigned size = 0;
+  for (int i = 0; i < 256 && client.poll(message, size); ++i) try {
+      client.queueReliable(message, size, 0, 0);
+    } catch (N_NetException_PacketsStackingUp*) {
+      // The probes would show it if a good client lost one.
+    }
+  client.flushReliable();
+} catch (Q_Exception*) {
+}
+
+std::vector<double> probe(PeerProcess& peer, const std::string& command, const Pump& pump) {
+  peer.command("probe " + command);
+  std::istringstream in(peer.waitLine("probe-", 20000, pump).value_or(""));
+  std::string answer;
+  in >> answer;
+  return {std::istream_iterator<double>(in), {}};
 }
 
 }  // namespace cs_test

@@ -1,8 +1,8 @@
 // Shared pieces of the client and server tests: the runtime fixture with the
 // client settings put back, white-box hooks for the heartbeat timers and the
-// pacing gates, scripted server and client ends made of plain N_Sockets (for
-// the exact bytes of the control channel), and client host processes (for
-// the unreliable channel and for several clients at once).
+// pacing gates, a scripted client end made of plain N_Sockets (for the exact
+// bytes of the control channel; the server end is raw_peer.h), and client
+// host processes (for the unreliable channel and for several clients at once).
 #pragma once
 
 #include <atomic>
@@ -21,6 +21,7 @@
 #include "N_Server.h"
 #include "N_Socket.h"
 #include "child_process.h"
+#include "raw_peer.h"
 #include "runtime_test.h"
 
 // Timer ages for the heartbeat limits and the pacing gates, which the public
@@ -34,7 +35,6 @@ struct N_ClientTestAccess {
   static float nextFlushTime(const N_Client& c) { return c.m_fNextFlushTime; }
   static float nextPollTime(const N_Client& c) { return c.m_fNextPollTime; }
   static float sendAge(const N_Client& c) { return c.m_sendTimer.getAge(); }
-  static N_Socket* controlSocket(const N_Client& c) { return c.m_pControlSocket; }
   static N_Socket* tcpSocket(const N_Client& c) { return c.m_pTcpSocket; }
 };
 
@@ -53,9 +53,6 @@ using ServerAccess = N_ServerTestAccess;
 using Bytes = std::vector<unsigned char>;
 
 inline void sleepMs(int milliseconds) { std::this_thread::sleep_for(std::chrono::milliseconds(milliseconds)); }
-// A control message as raw bytes, little-endian, cut to `size` when asked
-// (the value word is there even for 4-byte types, so a cut one carries known bytes).
-Bytes controlBytes(std::uint32_t type, std::uint32_t value = 0, int size = -1);
 std::string hostOf(const N_Client* client);
 
 // Heartbeats at 0.2 s / 0.2 s and the simulation off unless a test says
@@ -70,47 +67,16 @@ class ClientServerTest : public RuntimeTest {
   }
 };
 
-// One received control message, as the scripted ends record it.
-struct Received {
-  unsigned size;
-  std::uint32_t type, value;
-};
-
-// The server end played by plain sockets on a thread of its own: it accepts
-// the data connection on `port` and the control connection on 6000, records
-// every control message, and answers heartbeats and world-time requests by
-// its policy.
-class ScriptedServer {
- public:
-  explicit ScriptedServer(int port);
-  ~ScriptedServer();
-
-  std::atomic<bool> answerHeartbeats{true};
-  std::atomic<int> worldTimeAnswers{-1};  // how many more to answer; -1: all
-  std::atomic<float> worldTimeValue{100.0f};
-
-  std::vector<Received> control();
-  std::size_t count(std::uint32_t type);
-  bool connected(bool control);
-  void sendControl(const Bytes& bytes);
-  bool waitControl(std::size_t count, int milliseconds, const Pump& pump);
-
- private:
-  N_Listener m_dataListener, m_controlListener;
-  std::mutex m_lock;
-  std::unique_ptr<N_Socket> m_data, m_control;
-  std::vector<Received> m_received;
-  std::atomic<bool> m_bStop{false};
-  std::thread m_thread;
-};
+using raw_peer::controlBytes;
+using raw_peer::Received;
+using raw_peer::RawPeer;
 
 // The client end played by plain sockets on the test thread: a data
-// connection to `port` and a control connection to 6000.
+// connection to `port` (later, if asked) and a control connection to 6000.
 class ScriptedClient {
  public:
-  ScriptedClient(const N_Address* server, int port, bool openDataNow = true, bool openControlNow = true);
+  ScriptedClient(const N_Address* server, int port, bool openDataNow = true);
   void openData() { m_data.emplace(m_pServer, m_iPort, N_Socket::SOCKET_TCP); }
-  void openControl() { m_control.emplace(m_pServer, CM::CONTROL_PORT, N_Socket::SOCKET_TCP); }
   bool connected() { return m_data && m_data->isConnected() && m_control && m_control->isConnected(); }
   bool closed() { return !m_data->isConnected() && !m_control->isConnected(); }
   void send(std::uint32_t type, std::uint32_t value = 0) { sendRaw(controlBytes(type, value)); }
@@ -150,10 +116,11 @@ class ServerPump {
 // A scripted client that the server has paired and handed out.
 N_Client* pairUp(const ServerPump& pump, ScriptedClient& client);
 
-// One client host process (tests/hosts/client_peer.cpp) on 127.0.0.<n>.
+// One client host process (tests/hosts/client_peer.cpp) on 127.0.0.<n>,
+// with the heartbeat settings of this process.
 class PeerProcess {
  public:
-  PeerProcess(int hostNumber, int port, std::vector<std::string> extra = {});
+  PeerProcess(int hostNumber, int port);
   const std::string& host() const { return m_host; }
   // Reads lines until one contains `text`, pumping meanwhile.
   std::optional<std::string> waitLine(const std::string& text, int milliseconds, const Pump& pump = {});
@@ -167,7 +134,10 @@ class PeerProcess {
   ChildProcess m_process;
 };
 
-// The number after "<word> " in a line such as "bandwidth 35714".
-double valueOf(const std::string& line);
+// Echoes every message, as many as a pass takes, for the probes of the
+// client hosts; a peer that doesn't read loses its echoes.
+void echo(N_Client& client);
+// Sends "probe <command>" to the host and gives the numbers of its answer.
+std::vector<double> probe(PeerProcess& peer, const std::string& command, const Pump& pump);
 
 }  // namespace cs_test

@@ -15,9 +15,7 @@
 #include <cerrno>
 #include <filesystem>
 #include <fstream>
-#include <iterator>
 #include <set>
-#include <sstream>
 
 #include "N_Limits.h"
 #include "cs_fixture.h"
@@ -26,13 +24,12 @@ using namespace cs_test;
 
 namespace {
 
+// Sanitizer allocators keep freed memory: RSS says nothing there.
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
 constexpr bool kSanitized = true;
 #else
 constexpr bool kSanitized = false;
 #endif
-// Sanitizer allocators keep freed memory: RSS says nothing there.
-constexpr bool kRssMeaningful = !kSanitized;
 // Once the attacker has gone, all it opened is closed and due at the next
 // update; what a pairing time-out (5 s) holds, soon after.
 constexpr int kSettleMs = (5000 + 3000) * (kSanitized ? 4 : 1);
@@ -65,29 +62,6 @@ bool said(const ChildProcess& p, std::string_view prefix) {
   return std::ranges::any_of(p.lines(), [&](const std::string& line) { return line.starts_with(prefix); });
 }
 
-// Sends "probe <command>" and gives the numbers of the answer.
-std::vector<double> probe(PeerProcess& peer, const std::string& command, const Pump& pump) {
-  peer.command("probe " + command);
-  std::istringstream in(peer.waitLine("probe-", 20000, pump).value_or(""));
-  std::string answer;
-  in >> answer;
-  return {std::istream_iterator<double>(in), {}};
-}
-
-// Echoes every message, as many as a pass takes, for the probes.
-void echo(N_Client& client) try {
-  void* message = nullptr;
-  unsigned size = 0;
-  for (int i = 0; i < 256 && client.poll(message, size); ++i) try {
-      client.queueReliable(message, size, 0, 0);
-    } catch (N_NetException_PacketsStackingUp*) {
-      // A peer that doesn't read loses its echoes; the probes would show it
-      // if a good client did.
-    }
-  client.flushReliable();
-} catch (Q_Exception*) {
-}
-
 struct Attack {
   const char* name;
   double seconds;
@@ -98,19 +72,12 @@ struct Attack {
 
 class HostileTest : public ClientServerTest {
  protected:
-  void SetUp() override {
-    ClientServerTest::SetUp();
-    N_Initializer::setLimits(N_Limits::openNetwork());
-    heartbeat(0.5f, 4.0f);  // slow enough for sanitizer builds on a loaded machine
-  }
-  void TearDown() override {
-    ClientServerTest::TearDown();
-    N_Initializer::setLimits(N_Limits::defaults());
-  }
   void run(const Attack& a);
 };
 
 void HostileTest::run(const Attack& a) {
+  LimitsGuard protect(N_Limits::openNetwork());
+  heartbeat(0.5f, 4.0f);  // slow enough for sanitizer builds on a loaded machine
   // The server under attack, run the way an application would: update, the
   // hand-outs, echoes, disconnectClient for whatever is no longer connected.
   N_Server server(port());
@@ -136,15 +103,14 @@ void HostileTest::run(const Attack& a) {
     if (msSince(lastSample) > 5) lastSample = Clock::now(), peakRss = std::max(peakRss, rssBytes());
   };
   auto join = [&](int host) {  // starts probing once admitted
-    const std::vector<std::string> options = {"--hb-frequency", "0.5", "--hb-latency", "4"};
-    peers.push_back(std::make_unique<PeerProcess>(host, port(), options));
+    peers.push_back(std::make_unique<PeerProcess>(host, port()));
     return peers.back()->admit(serve) != nullptr && peers.back()->command("probe 20");
   };
   for (int host : {2, 3}) ASSERT_TRUE(join(host));
   pumpFor(1000, pump);
   auto level = [&] {
-    if (kRssMeaningful) ::malloc_trim(0);  // glibc keeps freed pages; trimmed, RSS shows what is held
-    return std::pair{outstanding(), kRssMeaningful ? rssBytes() : 0};
+    if (!kSanitized) ::malloc_trim(0);  // glibc keeps freed pages; trimmed, RSS shows what is held
+    return std::pair{outstanding(), !kSanitized ? rssBytes() : 0};
   };
   const auto before = level();
   for (auto& p : peers) probe(*p, "report", pump);

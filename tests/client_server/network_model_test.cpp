@@ -54,14 +54,12 @@ using NetworkModelTest = ClientServerTest;
 
 // Two connections, each with generators of its own per channel: the same
 // unreliable stream gets the same fate on both, whatever else either carries
-// meanwhile (b a reliable stream too). Then a cap on both, and the model off
-// while it holds messages.
-TEST_F(NetworkModelTest, TwoConnectionsFollowTheDrawsTheCapAndTheSwitch) {
-  heartbeat(1.0f, 1.0f);
+// meanwhile (b a reliable stream too). Then a cap on both.
+TEST_F(NetworkModelTest, TwoConnectionsFollowTheDrawsAndTheCap) {
+  heartbeat(1.0f, 5.0f);  // a loaded machine may hold a peer for a second
   N_Server server(port());
   ServerPump pump(server);
-  const std::vector<std::string> options = {"--hb-frequency", "1", "--hb-latency", "1"};
-  PeerProcess a(2, port(), options), b(3, port(), options);
+  PeerProcess a(2, port()), b(3, port());
   PeerProcess* peers[2] = {&a, &b};
   N_Client* clients[2] = {a.admit(pump), b.admit(pump)};
   ASSERT_TRUE(clients[0] != nullptr && clients[1] != nullptr);
@@ -85,6 +83,11 @@ TEST_F(NetworkModelTest, TwoConnectionsFollowTheDrawsTheCapAndTheSwitch) {
       return s.uReceived >= want[i] && s.uQueuedBytes == 0;
     };
     const bool done = waitFor([&] { return taken(0) && taken(1); }, 60000, read);
+    for (int i = 0; i < 2 && !done; ++i) {
+      const N_SimulationStats s = clients[i]->getSimulationStats();
+      ADD_FAILURE() << peers[i]->host() << ": " << s.uReceived << " of " << want[i] << " taken, " << s.uQueuedBytes
+                    << " bytes held, " << (clients[i]->isConnected() ? "connected" : "disconnected");
+    }
     pumpFor(100, read);
     return done;
   };
@@ -208,33 +211,6 @@ TEST_F(NetworkModelTest, TwoConnectionsFollowTheDrawsTheCapAndTheSwitch) {
     EXPECT_LE(s.dMeanDelay, 1000.0 * (kLimit + largest) / kCap);
   }
 
-  // Held for seconds, then the model goes off: what it holds is readable at
-  // once, in its order and ahead of what comes later, and the statistics of
-  // the last model that was on stay readable.
-  N_Client::simulateNetwork({.fDelay = 5000});
-  a.command("send-r 3 h 0 stamp");
-  ASSERT_TRUE(waitFor([&] { return clients[0]->getSimulationStats().uReceived == 3; }, 5000, read));
-  pumpFor(100, read);
-  // A new model starts the statistics again; what is held stays held.
-  const unsigned held = clients[0]->getSimulationStats().uQueuedBytes;
-  N_Client::simulateNetwork({.fDelay = 1000});
-  pumpFor(100, read);
-  EXPECT_TRUE(got[0]['h'].empty()) << "still held";
-  const N_SimulationStats changed = clients[0]->getSimulationStats();
-  EXPECT_EQ(0u, changed.uReceived);
-  EXPECT_GT(held, 0u);
-  EXPECT_EQ(held, changed.uQueuedBytes);
-  EXPECT_EQ(held, changed.uPeakQueuedBytes);
-  N_Client::simulateNetwork(N_NetworkModel{});
-  const Clock::time_point off = Clock::now();
-  a.command("send-r 1 k 0 stamp");
-  ASSERT_TRUE(waitFor([&] { return got[0]['k'].size() == 1; }, 5000, read));
-  EXPECT_LT(secondsSince(off), 1.0);
-  ASSERT_EQ(3u, got[0]['h'].size());
-  for (int i = 0; i < 3; ++i) EXPECT_EQ(i, got[0]['h'][i].index);
-  EXPECT_LE(got[0]['h'].back().readNs, got[0]['k'][0].readNs);
-  EXPECT_EQ((std::vector<unsigned>{0, 3, 0, 0, 0, 0, 0}), counts(clients[0]->getSimulationStats()));
-  EXPECT_EQ(0u, clients[0]->getSimulationStats().uQueuedBytes);
   EXPECT_TRUE(a.quit(10000, pump));
   EXPECT_TRUE(b.quit(10000, pump));
 }

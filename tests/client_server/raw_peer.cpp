@@ -35,26 +35,26 @@ std::vector<char> framed(const std::vector<char>& body) {
   return out;
 }
 
-std::vector<char> control(std::uint32_t type, std::uint32_t value) {
-  std::vector<char> body;
-  putWord(body, type);
-  if (type == 1 || type == 2 || type == kWorldTime) putWord(body, value);
-  return framed(body);
-}
-
 }  // namespace
 
-RawPeer::RawPeer(bool server, const char* ip, const char* peerIp, std::uint16_t port)
-    : m_start(std::chrono::steady_clock::now()) {
-  if (server) {
-    std::uint16_t controlPort = kControlPort;
-    m_dataListener = raw::listenOn(ip, port);
-    m_controlListener = raw::listenOn(ip, controlPort);
-  } else {
-    m_data = raw::connectTo(peerIp, port, ip);
-    m_control = raw::connectTo(peerIp, kControlPort, ip);
-    m_bConnected = m_data >= 0 && m_control >= 0;
-  }
+std::vector<unsigned char> controlBytes(std::uint32_t type, std::uint32_t value, int size) {
+  std::vector<char> body;
+  putWord(body, type);
+  putWord(body, value);
+  const bool valued = type == 1 || type == 2 || type == kWorldTime;
+  body.resize(size >= 0 ? static_cast<std::size_t>(size) : valued ? 8 : 4);
+  return {body.begin(), body.end()};
+}
+
+Received parse(const void* body, unsigned size) {
+  const auto* at = static_cast<const char*>(body);
+  return {size, size >= 4 ? word(at) : 0, size >= 8 ? word(at + 4) : 0};
+}
+
+RawPeer::RawPeer(const char* ip, const char* peerIp, std::uint16_t port) : m_start(std::chrono::steady_clock::now()) {
+  std::uint16_t controlPort = kControlPort;
+  m_dataListener = raw::listenOn(ip, port);
+  m_controlListener = raw::listenOn(ip, controlPort);
   m_udp = raw::udpBound(ip, static_cast<std::uint16_t>(port + 1));
   sockaddr_in to{};
   to.sin_family = AF_INET;
@@ -73,18 +73,20 @@ RawPeer::~RawPeer() {
 
 void RawPeer::run() {
   char datagram[65536];
-  bool dataOpen = true, controlOpen = true;
   while (!m_bStop) {
-    if (!m_bConnected) {
-      if (m_data < 0) m_data = raw::acceptOne(m_dataListener, 1);
-      if (m_control < 0) m_control = raw::acceptOne(m_controlListener, 1);
-      if (!m_bConnected && (m_data < 0 || m_control < 0)) continue;
-      m_bConnected = m_data >= 0 && m_control >= 0;
+    if (m_data < 0) {
+      m_data = raw::acceptOne(m_dataListener, 1);
+      m_bDataOpen = m_data >= 0;
     }
-    pollfd fds[3] = {{dataOpen ? m_data.load() : -1, POLLIN, 0}, {controlOpen ? m_control.load() : -1, POLLIN, 0}, {m_udp, POLLIN, 0}};
+    if (m_control < 0) {
+      m_control = raw::acceptOne(m_controlListener, 1);
+      m_bControlOpen = m_control >= 0;
+    }
+    pollfd fds[3] = {{m_bDataOpen ? m_data.load() : -1, POLLIN, 0}, {m_bControlOpen ? m_control.load() : -1, POLLIN, 0},
+                     {m_udp, POLLIN, 0}};
     if (::poll(fds, 3, 2) <= 0) continue;
-    if (fds[0].revents != 0) dataOpen = readStream(m_data, m_dataPending, m_received.reliable, false);
-    if (fds[1].revents != 0) controlOpen = readStream(m_control, m_controlPending, m_received.control, true);
+    if (fds[0].revents != 0) m_bDataOpen = readStream(m_data, m_dataPending, m_received.reliable, false);
+    if (fds[1].revents != 0) m_bControlOpen = readStream(m_control, m_controlPending, m_received.control, true);
     if (fds[2].revents & POLLIN) {
       const ssize_t n = ::recv(m_udp, datagram, sizeof datagram, MSG_DONTWAIT);
       std::lock_guard<std::mutex> hold(m_lock);
@@ -107,22 +109,23 @@ bool RawPeer::readStream(int fd, std::vector<char>& pending, Tally& tally, bool 
     tally.bytes += static_cast<std::uint64_t>(n);
     pending.insert(pending.end(), buffer, buffer + n);
     while (pending.size() >= 4 && pending.size() >= 4 + std::size_t{word(pending.data())}) {
-      const std::size_t length = word(pending.data());
+      const std::uint32_t length = word(pending.data());
       ++tally.messages;
-      if (isControl && length >= 4) {
-        types.push_back(word(pending.data() + 4));
-        m_controlTypes.push_back(types.back());
+      if (isControl) {
+        types.push_back(m_controlReceived.emplace_back(parse(pending.data() + 4, length)).type);
       }
       pending.erase(pending.begin(), pending.begin() + static_cast<std::ptrdiff_t>(4 + length));
     }
   }
   for (std::uint32_t type : types) {
-    if (type == kHeartbeat) {
+    if (type == kHeartbeat && answerHeartbeats) {
       sendControl(kHeartbeatReply);
-      sendControl(kHeartbeat);
-    } else if (type == kWorldTimeRequest) {
-      const float now =
-          worldTime.load() + std::chrono::duration<float>(std::chrono::steady_clock::now() - m_start).count();
+      if (heartbeatBack) sendControl(kHeartbeat);
+    }
+    if (type == kWorldTimeRequest && worldTimeAnswers != 0) {
+      if (worldTimeAnswers > 0) --worldTimeAnswers;
+      const float now = worldTime.load() +
+                        (worldTimeRuns ? std::chrono::duration<float>(std::chrono::steady_clock::now() - m_start).count() : 0.0f);
       std::uint32_t bits;
       std::memcpy(&bits, &now, sizeof bits);
       sendControl(kWorldTime, bits);
@@ -149,8 +152,8 @@ void RawPeer::sendUnreliable(std::size_t size, char fill) {
   send(m_udp, std::vector<char>(size, fill), m_sent.unreliable);
 }
 
-void RawPeer::sendControl(std::uint32_t type, std::uint32_t value) {
-  send(m_control, control(type, value), m_sent.control);
+void RawPeer::sendControlBytes(const std::vector<unsigned char>& body) {
+  send(m_control, framed(std::vector<char>(body.begin(), body.end())), m_sent.control);
 }
 
 Direction RawPeer::sent() {
@@ -163,10 +166,15 @@ Direction RawPeer::received() {
   return m_received;
 }
 
-unsigned RawPeer::controlCount(std::uint32_t type) {
+std::vector<Received> RawPeer::control() {
   std::lock_guard<std::mutex> hold(m_lock);
-  unsigned n = 0;
-  for (unsigned t : m_controlTypes) n += t == type;
+  return m_controlReceived;
+}
+
+std::size_t RawPeer::count(std::uint32_t type) {
+  std::lock_guard<std::mutex> hold(m_lock);
+  std::size_t n = 0;
+  for (const Received& r : m_controlReceived) n += r.type == type;
   return n;
 }
 

@@ -1,11 +1,10 @@
-// The other end of one connection played by plain Linux sockets, for the
-// statistics tests: the data stream, the control stream and the datagrams,
-// each counted byte by byte and message by message in both directions, as
-// the peer's system saw them (a stream's 4-byte prefixes included).
+// The server end of one connection played by plain Linux sockets: the data
+// stream, the control stream and the datagrams, each counted byte by byte and
+// message by message in both directions as the peer's system saw them (a
+// stream's 4-byte prefixes included), and every control message recorded.
 //
-// A thread of its own reads all three channels. On the control channel it
-// keeps the heartbeat going: every heartbeat gets a reply and a heartbeat of
-// its own, and every world-time request an answer.
+// A thread of its own reads all three channels and answers on the control
+// channel by its policy: heartbeats, world-time requests.
 // Kept apart from the library's headers, whose Winsock names Linux's macros
 // would clash with.
 #pragma once
@@ -31,31 +30,45 @@ struct Direction {
   Tally reliable, unreliable, control;
 };
 
+// One received control message: its size, its type and value words (0 where cut).
+struct Received {
+  unsigned size;
+  std::uint32_t type, value;
+};
+
+// A control message's body: the type word, and the value word for types 1,
+// 2 and 8; cut to `size` when asked (the value word is there even for 4-byte
+// types, so a cut one carries known bytes).
+std::vector<unsigned char> controlBytes(std::uint32_t type, std::uint32_t value = 0, int size = -1);
+// A control message's body as received: its size, type word and value word.
+Received parse(const void* body, unsigned size);
+
 class RawPeer {
  public:
-  // As the server: listens on ip:port and ip:6000, and exchanges datagrams
-  // between ip:port+1 and peerIp:port+1. As the client: connects from ip to
-  // peerIp:port and peerIp:6000, datagrams the same way.
-  RawPeer(bool server, const char* ip, const char* peerIp, std::uint16_t port);
+  // Listens on ip:port and ip:6000, and exchanges datagrams between
+  // ip:port+1 and peerIp:port+1.
+  RawPeer(const char* ip, const char* peerIp, std::uint16_t port);
   ~RawPeer();
   RawPeer(const RawPeer&) = delete;
   RawPeer& operator=(const RawPeer&) = delete;
 
-  // Both streams are accepted (server) or connected (client).
-  bool connected() const { return m_bConnected; }
   // One packaged message of `size` bytes of `fill` on the data stream.
   void sendReliable(std::size_t size, char fill);
   void sendUnreliable(std::size_t size, char fill);
-  // A control message: the type word, and the value word for types 1, 2, 8.
-  void sendControl(std::uint32_t type, std::uint32_t value = 0);
+  void sendControl(std::uint32_t type, std::uint32_t value = 0) { sendControlBytes(controlBytes(type, value)); }
+  void sendControlBytes(const std::vector<unsigned char>& body);  // packaged as given, cut ones too
 
   Direction sent();
   Direction received();
-  // Received control messages of `type`.
-  unsigned controlCount(std::uint32_t type);
+  std::vector<Received> control();
+  std::size_t count(std::uint32_t type);  // received control messages of `type`
+  bool open(bool control) const { return control ? m_bControlOpen : m_bDataOpen; }  // accepted, not closed
 
-  // The world time it answers: this plus its own age.
-  std::atomic<float> worldTime{50.0f};
+  std::atomic<bool> answerHeartbeats{true};
+  std::atomic<bool> heartbeatBack{false};  // a heartbeat of its own after each reply
+  std::atomic<int> worldTimeAnswers{-1};   // how many more to answer; -1: all
+  std::atomic<float> worldTime{100.0f};
+  std::atomic<bool> worldTimeRuns{false};  // the answer adds the peer's own age
 
  private:
   void run();
@@ -67,13 +80,13 @@ class RawPeer {
   int m_dataListener = -1, m_controlListener = -1;
   // Set by the thread when accepted, read by the senders.
   std::atomic<int> m_data{-1}, m_control{-1};
+  std::atomic<bool> m_bDataOpen{false}, m_bControlOpen{false};
   int m_udp = -1;
-  std::atomic<bool> m_bConnected{false};
   std::atomic<bool> m_bStop{false};
   std::mutex m_write;  // one writer at a time on each stream
   std::mutex m_lock;   // the tallies
   Direction m_sent, m_received;
-  std::vector<unsigned> m_controlTypes;
+  std::vector<Received> m_controlReceived;
   std::vector<char> m_dataPending, m_controlPending;
   std::thread m_thread;
 };

@@ -45,25 +45,20 @@ inline void send(N_Socket& s, const Bytes& m) { s.send(const_cast<unsigned char*
 inline void inject(N_Socket& s, const Bytes& read) { N_SocketTestAccess::read(s, read.data(), static_cast<unsigned>(read.size())); }
 inline bool rawSend(int fd, const Bytes& b) { return raw::sendAll(fd, b.data(), b.size()); }
 
-// The next message poll() gives within the time, copied out.
-inline bool pollMessage(N_Socket& s, Bytes& out, int milliseconds = 5000) {
-  void* data = nullptr;
-  unsigned size = 0;
-  if (!waitFor([&] { return s.poll(data, size); }, milliseconds)) return false;
-  out.assign(static_cast<unsigned char*>(data), static_cast<unsigned char*>(data) + size);
-  return true;
-}
 // The next message poll() gives within the time is `expected`.
 inline ::testing::AssertionResult nextMessage(N_Socket& s, const Bytes& expected, int milliseconds = 5000) {
-  Bytes got;
-  if (!pollMessage(s, got, milliseconds)) return ::testing::AssertionFailure() << "no message";
-  if (got != expected) return ::testing::AssertionFailure() << got.size() << " bytes, not the " << expected.size() << " expected";
+  void* data = nullptr;
+  unsigned size = 0;
+  if (!waitFor([&] { return s.poll(data, size); }, milliseconds)) return ::testing::AssertionFailure() << "no message";
+  if (Bytes(static_cast<unsigned char*>(data), static_cast<unsigned char*>(data) + size) != expected)
+    return ::testing::AssertionFailure() << size << " bytes, not the " << expected.size() << " expected";
   return ::testing::AssertionSuccess();
 }
 // Nothing more to poll within the time.
 inline bool noMessage(N_Socket& s, int milliseconds = 100) {
-  Bytes got;
-  return !pollMessage(s, got, milliseconds);
+  void* data = nullptr;
+  unsigned size = 0;
+  return staysFalse([&] { return s.poll(data, size); }, milliseconds);
 }
 // The socket of the next disconnect event within the time, null if none.
 inline const N_Socket* nextDisconnect(int milliseconds = 5000) {
@@ -84,7 +79,6 @@ class RecordingSocket : public N_Socket {
     std::lock_guard<std::mutex> hold(m_lock);
     return m_messages;
   }
-  bool waitCount(std::size_t n, int ms = 10000) { return waitFor([&] { return messages().size() >= n; }, ms); }
   bool keep = false;
   std::mutex m_lock;
   std::vector<Bytes> m_messages;

@@ -2,10 +2,9 @@
 //   vardel_host_client_peer --host 127.0.0.2 --server 127.0.0.1 --port P [--hb-frequency F] [--hb-latency L]
 // It makes its own runtime on --host, connects and calls update() about
 // every millisecond. It prints "connected" / "lost" as isConnected() changes,
-// "bandwidth N" and "latency X" as they change, "recv N TEXT" for each
+// "bandwidth N" as it changes, "recv N TEXT" for each
 // message, "flushed", "error TEXT", and "bye" at "quit". Commands:
-//   limits                    prints "limits LARGEST", the largest unreliable size
-//   stall SECONDS | bandwidth N | fr | fu (flush reliable / unreliable once)
+//   bandwidth N | fr | fu (flush reliable / unreliable once)
 //   qrn KEY PRIO SIZE CHAR | qun ...   queue SIZE copies of CHAR, reliable / unreliable
 //   send-r COUNT PREFIX [MS [stamp]] | send-u ...
 //        COUNT payloads "PREFIX<i>;", each once the queue is empty again and
@@ -69,15 +68,18 @@ struct Probe {
   std::vector<double> window;  // round trips (ms) since the last report
   Clock::time_point last, stoppedAt;
 
-  bool take(const std::string& text) {  // false if the batch holds no echoes
-    if (text.empty() || text[0] != '#') return false;
-    for (std::size_t at = 0, end; (end = text.find(';', at)) != std::string::npos; at = end + 1, ++echoed) {
+  // Takes the echoes among the payloads of a batch; false if it holds none.
+  bool take(const std::string& text) {
+    const std::size_t before = echoed;
+    for (std::size_t at = 0, end; (end = text.find(';', at)) != std::string::npos; at = end + 1) {
+      if (text[at] != '#') continue;
+      ++echoed;
       const std::size_t n = std::strtoul(text.c_str() + at + 1, nullptr, 10);
       disorder += n != expected;
       if (n < sentAt.size()) window.push_back(std::chrono::duration<double, std::milli>(Clock::now() - sentAt[n]).count());
       expected = n + 1;
     }
-    return true;
+    return echoed > before;
   }
   void step(N_Client& client) {
     const Clock::time_point now = Clock::now();
@@ -103,13 +105,7 @@ struct Probe {
 };
 
 void run(N_Client& client, std::istringstream& in, const std::string& command, Sender* senders, Probe& probe) {
-  if (command == "limits") {
-    say("limits " + std::to_string(client.getLargestUnreliablePacketSize()));
-  } else if (command == "stall") {
-    double seconds = 0;
-    in >> seconds;
-    std::this_thread::sleep_for(std::chrono::duration<double>(seconds));
-  } else if (command == "bandwidth") {
+  if (command == "bandwidth") {
     unsigned value = 0;
     in >> value;
     client.setBandwidth(value);
@@ -157,7 +153,6 @@ int main(int argc, char** argv) {
     auto client = std::make_unique<N_Client>(&serverAddress, port);
     bool connected = false;
     unsigned lastBandwidth = 0;
-    float lastLatency = client->getLatency();
     CommandInput input;
     Sender senders[2];  // reliable, unreliable
     senders[1].reliable = false;
@@ -190,7 +185,6 @@ int main(int argc, char** argv) {
       }
       if (connected && client->getBandwidth() != lastBandwidth)
         say("bandwidth " + std::to_string(lastBandwidth = client->getBandwidth()));
-      if (client->getLatency() != lastLatency) say("latency " + std::to_string(lastLatency = client->getLatency()));
     }
     return 0;
   } catch (Q_Exception* e) {

@@ -7,7 +7,6 @@
 #include <unistd.h>
 
 #include <atomic>
-#include <cstdio>
 #include <cstring>
 #include <ctime>
 #include <filesystem>
@@ -53,12 +52,7 @@ std::uint32_t lookUp(const char* host) {
 // What the start meets: the catalogue of providers, the agreed version, the
 // local host and its lookup.
 using Arm = std::function<void(FaultGuard&)>;
-constexpr DWORD kTcp[] = {platform::XP1_GUARANTEED_DELIVERY, platform::XP1_GUARANTEED_ORDER,
-                          platform::XP1_GRACEFUL_CLOSE, platform::XP1_EXPEDITED_DATA, platform::XP1_IFS_HANDLES};
-constexpr DWORD kUdp[] = {platform::XP1_CONNECTIONLESS, platform::XP1_MESSAGE_ORIENTED,
-                          platform::XP1_SUPPORT_BROADCAST, platform::XP1_SUPPORT_MULTIPOINT, platform::XP1_IFS_HANDLES};
 constexpr DWORD kAllTcp = 0x20066, kAllUdp = 0x20609;
-constexpr const char* kNoTcp = "TCP protocol not found";
 constexpr const char* kVersion = "Winsock version 2.0 or newer required";
 constexpr const char* kNotResolved = "IP address is not resolved yet";
 
@@ -81,9 +75,8 @@ Arm localHost(const char* host, Call call = Call::Count, int countdown = 1) {
 // number needs no lookup, a name must resolve before the start returns), a
 // further one only counts, the last stop takes everything down, and a later
 // start makes everything anew. Without its thread the runtime still comes
-// up, and its stop doesn't wait for a thread that never ran. For each kind
-// the first IPv4 catalogue entry with every bit wins, however late; type and
-// protocol aren't looked at. Without a runtime an address still resolves.
+// up, and its stop doesn't wait for a thread that never ran. Without a
+// runtime an address still resolves.
 TEST(Runtime, StartsOnTheChosenLocalHostCountsInstancesAndRestarts) {
   Watchdog dog(60.0, "starts and stops");
   AllocationBalance balance;
@@ -93,13 +86,9 @@ TEST(Runtime, StartsOnTheChosenLocalHostCountsInstancesAndRestarts) {
     EXPECT_TRUE(alone.wait(10.0f));
   }
   EXPECT_TRUE(waitFor([&] { return threadCount() == idle; })) << "the resolver";
-  std::vector<WSAPROTOCOL_INFOA> late(20, entry(23, kAllTcp | kAllUdp));
-  for (DWORD bit : kTcp) late.push_back(entry(2, kAllTcp & ~bit));
-  late.push_back(entry(2, kAllUdp | 0x80000000u));
-  late.push_back(entry(2, kAllTcp | 0x10u));
   struct Start { const char* host; Arm arm; bool threadless = false; };
   const std::vector<Start> starts = {{"127.0.0.2", localHost("127.0.0.2")}, {"localhost", localHost("localhost")},
-                                     {"127.0.0.1", catalogue({entry(2, kAllTcp | kAllUdp)})}, {"127.0.0.1", catalogue(late)},
+                                     {"127.0.0.1", catalogue({entry(23, kAllTcp | kAllUdp), entry(2, kAllTcp | kAllUdp)})},
                                      {"127.0.0.1", [](FaultGuard& f) { f.arm(Call::AfxBeginThread, {1, false, 10055}); }, true}};
   for (std::size_t i = 0; i < starts.size(); ++i) {
     const Start& s = starts[i];
@@ -242,7 +231,6 @@ TEST_F(RuntimeLife, LockOrderHoldsOnAllPathsAtOnce) {
   sleepMs(2000);
   stop = true;
   for (std::thread& t : threads) t.join();
-  std::printf("%d rounds\n", rounds.load());
   EXPECT_GT(rounds.load(), 0);
   EXPECT_TRUE(waitFor([&] { return threadCount() <= idle; }, 30000)) << "resolvers still running";
 }
@@ -260,32 +248,23 @@ struct StartCase {
 void PrintTo(const StartCase& c, std::ostream* os) { *os << c.name; }
 
 std::vector<StartCase> startCases() {
-  std::vector<StartCase> cases = {
+  return {
       {"SystemNotReady", startup(10091), "WINSOCK: Network subsystem is unavailable", false},
       {"VersionNotSupported", startup(10092), "WINSOCK: DLL version out of range", false},
       {"ProcessLimit", startup(10067), "WINSOCK: Too many processes", false},
       {"OtherRefusalFailsTheVersionTest", startup(10014), kVersion, false},
-      {"Version1_0", version(0x0001), kVersion, false},
       {"Version1_1", version(0x0101), kVersion, false},
       {"Version2_1", version(0x0102), kVersion, false},  // the minor version is the high byte
-      {"Version2_2", version(0x0202), kVersion, false},
       {"Version3_0", version(0x0003), kVersion, false},
-      {"EmptyCatalogue", catalogue({}), kNoTcp},
-      {"FailedEnumeration", [](FaultGuard& f) { f.arm(Call::WSAEnumProtocolsA, {1, true, 10055}); }, kNoTcp},
-      {"OnlyOutsideIpv4", catalogue({entry(23, kAllTcp | kAllUdp), entry(0, kAllTcp)}), kNoTcp},
-      {"TcpIsJudgedFirst", catalogue({entry(2, kAllUdp & ~kTcp[4]), entry(2, kAllTcp & ~kTcp[4])}), kNoTcp},
+      {"NoIpv4Tcp", catalogue({entry(23, kAllTcp | kAllUdp), entry(2, kAllTcp & ~0x2u), entry(2, kAllUdp)}), "TCP protocol not found"},
+      {"FailedEnumeration", [](FaultGuard& f) { f.arm(Call::WSAEnumProtocolsA, {1, true, 10055}); }, "TCP protocol not found"},
+      {"NoUdp", catalogue({entry(2, kAllTcp), entry(2, kAllUdp & ~0x200u)}), "UDP protocol not found"},
       {"UnknownHost", localHost("no-such-host.invalid"), kNotResolved, true, true},
       {"FailedLookup", localHost("localhost", Call::gethostbyname), kNotResolved, true, true},
       {"AllZeros", localHost("0.0.0.0"), kNotResolved, true, true},
       // The first thread is the network thread, the second the resolver.
       {"NoResolver", localHost("localhost", Call::AfxBeginThread, 2), kNotResolved, true, true},
   };
-  for (int i = 0; i < 5; ++i) {
-    const std::string bit = std::to_string(i);
-    cases.push_back({"TcpWithoutBit" + bit, catalogue({entry(2, kAllTcp & ~kTcp[i]), entry(2, kAllUdp)}), kNoTcp});
-    cases.push_back({"UdpWithoutBit" + bit, catalogue({entry(2, kAllTcp), entry(2, kAllUdp & ~kUdp[i])}), "UDP protocol not found"});
-  }
-  return cases;
 }
 
 class StartFailure : public ::testing::TestWithParam<StartCase> {};
@@ -385,32 +364,25 @@ TEST_F(Address, TheGivenHalfIsThereAtOnceAndTheLookupBringsTheOther) {
   EXPECT_EQ("localhost", text(byName.getStringName())) << "the given name stays, not a canonical one";
 }
 
-// Digits and dots make a number, anything else a name; the shape isn't
-// checked. With both lookups failing, only the given half is ever there.
+// Digits and dots make a number, anything else a name. With both lookups
+// failing, only the given half is ever there.
 TEST_F(Address, TextIsReadByItsCharactersOnly) {
   FaultGuard faults(Call::gethostbyname, {.countdown = 1, .persist = true, .result = 11001});
   faults.arm(Call::gethostbyaddr, {.countdown = 1, .persist = true, .result = 11001});
-  for (const char* number : {"12345", "....", "", "1.2.3.4.5.6", "0.9"}) {
-    N_Address a(number);
+  for (auto [given, number] : {std::pair{"1.2.3.4.5.6", true}, {"12345", true}, {"1.2.3.x", false}, {"127.0.0.1 ", false}}) {
+    N_Address a(given);
     ASSERT_TRUE(resolversDone());
-    EXPECT_EQ(number, text(a.getStringNumber()));
-    EXPECT_EQ(nullptr, a.getStringName()) << number;
-    EXPECT_EQ(platform::inet_addr(number), a.getIdentifier()) << number;
+    EXPECT_EQ(given, text(number ? a.getStringNumber() : a.getStringName()));
+    EXPECT_EQ(nullptr, number ? a.getStringName() : a.getStringNumber()) << given;
+    EXPECT_EQ(number ? platform::inet_addr(given) : 0u, a.getIdentifier()) << given;
   }
-  for (const char* name : {"1.2.3.x", "/", ":", "127.0.0.1 ", "12\x80", "no-such-host.invalid"}) {
-    N_Address a(name);
-    ASSERT_TRUE(resolversDone());
-    EXPECT_EQ(name, text(a.getStringName()));
-    EXPECT_EQ(nullptr, a.getStringNumber()) << name;
-    EXPECT_EQ(0u, a.getIdentifier()) << name;
-  }
-  EXPECT_EQ(6, platform::fault::fired(Call::gethostbyname));
+  EXPECT_EQ(2, platform::fault::fired(Call::gethostbyname));
   N_Address none(nullptr), zeros("0.0.0.0");
   ASSERT_TRUE(resolversDone());
   EXPECT_EQ("", text(none.getStringNumber())) << "null is the empty number";
   EXPECT_EQ(platform::INADDR_NONE, none.getIdentifier());
   EXPECT_EQ(0u, zeros.getIdentifier());
-  EXPECT_EQ(6, platform::fault::fired(Call::gethostbyaddr)) << "0.0.0.0 is never looked up";
+  EXPECT_EQ(3, platform::fault::fired(Call::gethostbyaddr)) << "0.0.0.0 is never looked up";
   const auto start = Clock::now();
   EXPECT_FALSE(none.wait(0.3f)) << "a number without a name never resolves fully";
   EXPECT_GE(secondsSince(start), 0.29) << "wait gave up early";
