@@ -113,8 +113,10 @@ TEST(QDLList, KeepsOrderAddressesAndIndicesThroughChangesAndFailuresAndFreesEver
     EXPECT_EQ(nullptr, list.getAt(0));
     for (int i : {7, 8}) *list.append() = i;
     EXPECT_EQ((std::vector<int>{7, 8}), walk(list)) << "an emptied list is usable again";
+    list.m_pSpareA = Q_Memory::allocate(32);
+    list.m_pSpareB = Q_Memory::allocate(8);
   }
-  EXPECT_EQ(1, balance.outstanding()) << "the destructor frees the nodes left";
+  EXPECT_EQ(1, balance.outstanding()) << "the destructors free the nodes left and both spare blocks, once";
   // getAt in any order, and after the list changed under an index.
   IntList list;
   for (int i = 0; i < 10; ++i) *list.append() = i;

@@ -302,6 +302,47 @@ TEST(Overlapped, ManySendsArriveIntactAndCompleteInOrder) {
       << "a broken stream refuses further sends at once";
 }
 
+void refuseRegistrations(bool refuse);  // epoll_faults.cpp
+
+// A registration the system refuses fails the wait until the system agrees,
+// also when a socket comes back into the wait (FD_READ wanted again after a
+// read) and is found missing from the epoll set.
+TEST(Wait, RefusedRegistrationsFailTheWaitUntilTheSystemAgrees) {
+  Winsock ws;
+  WSAEVENT event = WSACreateEvent();
+  SOCKET in = udpSocket(), out = udpSocket();
+  sockaddr_in a = loopback(0);
+  int length = sizeof a;
+  ASSERT_EQ(0, bind(in, asAddr(a), sizeof a));
+  ASSERT_EQ(0, getsockname(in, reinterpret_cast<sockaddr*>(&a), &length));
+  ASSERT_EQ(0, WSAConnect(out, asAddr(a), sizeof a, nullptr, nullptr, nullptr, nullptr));
+  ASSERT_EQ(0, WSAEventSelect(in, event, FD_READ));
+  Record sent, taken;
+  char byte = 0;
+  std::thread([&] {  // a thread of its own: its wait set starts empty
+    const auto wait = [&](DWORD ms) {
+      DWORD r, index = 0;
+      while ((r = waitForAnyEvent(1, &event, ms, TRUE, &index)) == WSA_WAIT_IO_COMPLETION) {
+      }
+      return r;
+    };
+    for (const bool readFirst : {false, true}) {
+      refuseRegistrations(true);
+      if (readFirst) post(false, in, &byte, 1, taken);  // takes the datagram: FD_READ wanted again
+      EXPECT_EQ(0, post(true, out, "x", 1, sent));
+      EXPECT_EQ(WSA_WAIT_FAILED, wait(100)) << readFirst;
+      EXPECT_EQ(WSAENOBUFS, WSAGetLastError());
+      refuseRegistrations(false);
+      EXPECT_EQ(WSA_WAIT_EVENT_0, wait(5000)) << readFirst;
+      WSANETWORKEVENTS ne{};
+      EXPECT_EQ(0, WSAEnumNetworkEvents(in, event, &ne));
+    }
+  }).join();
+  closesocket(in);
+  closesocket(out);
+  WSACloseEvent(event);
+}
+
 // Beyond Winsock's 64: a thousand events (and Winsock's own wait over the
 // first 64). Indices of 192 and 258 are indices, not other results; the
 // lowest signalled one wins however the array changes between waits; a
