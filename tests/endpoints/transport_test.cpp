@@ -168,10 +168,15 @@ TEST_F(TransportFaultsTest, FailedAcceptsLeaveTheConnectionForTheNext) {
     }
     N_Socket::ConnectData* entry = nullptr;
     ASSERT_TRUE(waitFor([&] {
-      while (listener.pollConnect(entry) && entry->socket == platform::INVALID_SOCKET) EXPECT_TRUE(listener.rejectConnect(entry));
-      return listener.pollConnect(entry);
+      while (listener.pollConnect(entry)) {
+        if (entry->socket != platform::INVALID_SOCKET) return true;
+        EXPECT_TRUE(listener.rejectConnect(entry));
+      }
+      return false;
     }));
-    EXPECT_TRUE(error == platform::WSAEMFILE || listener.calls == (error == platform::WSAENOBUFS ? 2 : 1));
+    // An entry is queued before its listener hears of it.
+    const int calls = error == platform::WSAENOBUFS ? 2 : 1;
+    EXPECT_TRUE(error == platform::WSAEMFILE || waitFor([&] { return listener.calls == calls; }));
     if (error == platform::WSAEMFILE) {  // a valid entry refused, by its own listener only, closes its connection
       N_Listener other(freePort());
       EXPECT_FALSE(other.rejectConnect(entry));
